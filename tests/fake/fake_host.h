@@ -1,0 +1,101 @@
+// In-process fake of the host services for unit tests.
+//
+// Database: records every statement, answers from scripted rules, counts the
+// results handed out and freed. Camera: records every call of the camera layer,
+// with switches for faults. Syslog: captured line by line.
+// All state is global (the library calls free functions); call fake::Reset()
+// at the start of every test. Thread-safe: executor workers call in too.
+#ifndef TESTS_FAKE_FAKE_HOST_H
+#define TESTS_FAKE_FAKE_HOST_H
+
+#include <chrono>
+#include <functional>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "host/camera.h"
+
+namespace fake {
+
+// ---- database ----
+
+using Row = std::map<std::string, std::optional<std::string>>;  // column -> text (nullopt: NULL)
+
+struct Answer {
+    int rc = 0;             // what OvDBExecute returns
+    std::vector<Row> rows;  // rows of the result
+};
+
+// A rule answers every statement that contains `match` (first match wins).
+// `times` > 0: the rule is used that many times, then dropped.
+void OnSql(const std::string& match, Answer answer, int times = 0);
+// A handler sees every statement before the rules; returning an answer ends the search.
+void OnSqlHandler(std::function<std::optional<Answer>(const std::string&)> handler);
+
+std::vector<std::string> Statements();  // every statement, in order
+int ResultsOutstanding();               // results made minus results freed
+int NullResultsFreed();                 // KELODBFreeResult(nullptr) calls
+
+// ---- camera ----
+
+struct FakeCamera {
+    CameraSettings settings;     // what Camera::Load gives (settings.id is the key)
+    int connStatus = 1;          // GetCamConnStatus
+    bool loadFails = false;      // Camera::Load returns -1
+};
+
+struct FakeCameraHost {  // keyed by host name: what the control object does
+    bool apiNull = false;                    // newCameraAPI returns null
+    bool userApiNull = true;                 // newUserDefinedAPI returns null
+    int setResoRc = 0;
+    int presetListRc = 0;
+    std::map<int, std::string> presets;      // what GetPresetList reports
+    std::vector<int> refusedPositions;       // GoPreset fails for these
+    int snapshotPathRc = 0;
+    std::string snapshotPath = "/snap.jpg";
+    std::optional<int> snapshotPort;         // replaces the port when set
+    int snapshotType = 1;
+};
+
+void AddCamera(const FakeCamera& camera);
+FakeCameraHost& CameraHost(const std::string& host);  // created on first use
+
+struct CameraCall {
+    std::string what;  // "GetCamConnStatus 7", "Camera::Load 7", "newCameraAPI cam7 80 ...",
+                       // "SetReso 640x480", "GetPresetList", "GetSnapshotPath", "GoPreset 5 kelo5",
+                       // "releaseCameraAPI"
+    std::chrono::steady_clock::time_point when;
+};
+std::vector<CameraCall> CameraCalls();
+std::vector<std::string> CameraCallNames();  // the `what` of each call
+std::vector<std::string> Moves();            // "5 kelo5" for every accepted or refused GoPreset
+int ApisOutstanding();                       // control objects made minus released
+
+// Runs inside every GoPreset before it answers (e.g. to block or count).
+void OnGoPreset(std::function<void(int position, const std::string& name)> hook);
+
+// ---- syslog ----
+
+struct LogLine {
+    int priority;
+    std::string text;
+};
+std::vector<LogLine> Logs();
+std::vector<std::string> LogTexts();
+
+// Forgets every rule, record, camera and log line, and runs every hook that
+// other fakes registered with ResetHook.
+void Reset();
+struct ResetHook {
+    explicit ResetHook(std::function<void()> hook);
+};
+
+// Polls `condition` every millisecond until it holds or `timeout` passes.
+bool WaitFor(const std::function<bool()>& condition, std::chrono::milliseconds timeout);
+
+}  // namespace fake
+
+#endif  // TESTS_FAKE_FAKE_HOST_H
