@@ -10,7 +10,7 @@
 //   GET  /snapshot.jpg?profile=P   JPEG filled with the colour of the current preset
 //   GET  /mjpeg?profile=P&frames=N multipart/x-mixed-replace, 10 frames a second
 // and, without auth, the control endpoints for tests:
-//   GET  /control/ping | /control/presets | /control/moves | /control/now | /control/current
+//   GET  /control/ping | presets | moves | now | current | requests (count, control aside)
 //   POST /control/presets (lines "token<TAB>name"), /control/moves/clear,
 //        /control/fault ("name=value"; empty value clears), /control/faults/clear
 // Faults: delay_ms, status, refuse, snapshot_delivery (length|chunked|close),
@@ -167,6 +167,10 @@ void Serve(State& state, httplib::Server& svr) {
 
     svr.set_pre_routing_handler([&state](const httplib::Request& req, httplib::Response& res) {
         if (IsControl(req.path)) return httplib::Server::HandlerResponse::Unhandled;
+        {
+            std::lock_guard<std::mutex> lock(state.mu);
+            ++state.requests;
+        }
         long delay = atol(state.Fault("delay_ms").c_str());
         if (delay > 0) std::this_thread::sleep_for(std::chrono::milliseconds(std::min(delay, 60000L)));
         int status = atoi(state.Fault("status").c_str());
@@ -266,6 +270,10 @@ void Serve(State& state, httplib::Server& svr) {
         char t[40];
         snprintf(t, sizeof t, "%.6f\n", state.Now());
         res.set_content(t, "text/plain");
+    });
+    svr.Get("/control/requests", [&state](const httplib::Request&, httplib::Response& res) {
+        std::lock_guard<std::mutex> lock(state.mu);
+        res.set_content(std::to_string(state.requests) + "\n", "text/plain");
     });
     svr.Get("/control/current", [&state](const httplib::Request&, httplib::Response& res) {
         res.set_content(CurrentToken(state) + "\n", "text/plain");

@@ -30,6 +30,7 @@ struct State {
     std::vector<Move> moves;               // accepted GotoPreset requests
     std::map<std::string, std::string> faults;
     std::string current;                   // token of the preset we are at ("" none yet)
+    long requests = 0;                     // requests received, control endpoints aside
     std::chrono::steady_clock::time_point start = std::chrono::steady_clock::now();
 
     std::string Fault(const std::string& name);  // "" when not set
