@@ -100,20 +100,20 @@ private:
         // Later keywords win: the host's settings may override the timeout.
         const char* keys[] = {"connect_timeout", "dbname", "client_encoding", nullptr};
         const char* values[] = {"10", conninfo.c_str(), "UTF8", nullptr};
-        return ConnPtr(PQconnectdbParams(keys, values, 1));
+        ConnPtr conn(PQconnectdbParams(keys, values, 1));
+        // Server notices are not the host's business; libpq would print them to stderr.
+        if (conn) PQsetNoticeProcessor(conn.get(), [](void*, const char*) {}, nullptr);
+        return conn;
     }
 
-    // An idle connection whose server went away has an end-of-file (and often
-    // a termination notice) waiting on its socket: read it before sending.
+    // An idle connection has nothing to read unless its server sent a
+    // termination notice or closed it (restart, shutdown, idle kill): then it
+    // is reset before a statement is sent on it.
     static bool Healthy(PGconn* conn) {
         if (PQstatus(conn) != CONNECTION_OK) return false;
         struct pollfd pfd = {PQsocket(conn), POLLIN, 0};
         if (pfd.fd < 0) return false;
-        if (poll(&pfd, 1, 0) > 0) {
-            if (!PQconsumeInput(conn)) return false;
-            while (PGnotify* n = PQnotifies(conn)) PQfreemem(n);
-        }
-        return PQstatus(conn) == CONNECTION_OK;
+        return poll(&pfd, 1, 0) == 0;
     }
 
     std::mutex mu_;
