@@ -21,7 +21,8 @@
 // clock_skew_s, no_get_services, no_get_capabilities, alt_paths
 // (/onvif/Media, /onvif/PTZ), internal_address ("host:port" reported in
 // service and snapshot addresses, as a camera behind NAT does).
-// GotoPreset carries only a token; every one received is logged on stderr.
+// GotoPreset carries only a token; every one received is logged on stderr
+// (unless the environment has CAMSIM_QUIET).
 #include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
