@@ -26,7 +26,8 @@
 // Preset positions: see onvif_soap.h (decimal tokens are their number, other
 // tokens a stable negative number). GoPreset with a negative position looks
 // its token up in the camera's preset list; a position the camera does not
-// have is a failure. GotoPreset returns before the camera arrives.
+// have is a failure. GotoPreset carries only the preset token: GoPreset's
+// name argument is not sent. GotoPreset returns before the camera arrives.
 //
 // Every CameraAPI call is bounded by CallTimeoutMs() in all (connect, all its
 // requests). What is discovered about a camera (service paths, profiles,
