@@ -68,7 +68,10 @@ size_t Collect(char* data, size_t size, size_t n, void* out) {
     return size * n;
 }
 
-enum class Outcome { kOk, kTransport, kRefused };
+// kRefused: the camera failed the request (a fault, an error status, a reply
+// we cannot read), which kept knowledge may explain; kAbsent: the camera's
+// own fresh answer says the thing asked for does not exist.
+enum class Outcome { kOk, kTransport, kRefused, kAbsent };
 
 class OnvifCamera : public CameraAPI {
 public:
@@ -138,7 +141,7 @@ public:
                     Outcome o = FetchPresets(d, list);
                     if (o != Outcome::kOk) return o;
                     it = d.textTokens.find(position);
-                    if (it == d.textTokens.end()) return Outcome::kRefused;
+                    if (it == d.textTokens.end()) return Outcome::kAbsent;
                 }
                 token = it->second;
             }
@@ -169,6 +172,7 @@ private:
         }
         Outcome o = op(d);
         if (o == Outcome::kOk) return 0;
+        if (o == Outcome::kAbsent) return -1;
         Forget();
         if (fresh || o == Outcome::kTransport) return -1;
         d = Discovery();

@@ -34,7 +34,8 @@
 // clock offset, the tokens of text presets, snapshot URIs) and its open HTTP
 // connections are kept per "host:port" across control objects, thread-safely,
 // and forgotten when a call fails; a call that failed on what was kept
-// discovers afresh and tries once more (within the same time bound). So with
+// discovers afresh and tries once more (within the same time bound; not when
+// the camera's fresh preset list lacks the position asked for). So with
 // a warm cache GetPresetList and GoPreset each cost one round trip.
 #ifndef HOSTLIB_ONVIF_CAMERA_H
 #define HOSTLIB_ONVIF_CAMERA_H
