@@ -11,7 +11,10 @@ namespace {
 class UserDefinedCamera : public CameraAPI {
 public:
     UserDefinedCamera(const std::string& path, const std::string& type)
-        : path_(path), type_(type == "1" ? 1 : type == "2" ? 2 : -1) {}
+        : path_(path),
+          type_(type == "1"   ? 1
+                : type == "2" ? 2
+                              : -1) {}
 
     int SetReso(std::string) override { return 0; }
     int GetPresetList(std::map<int, std::string>&) override { return -1; }

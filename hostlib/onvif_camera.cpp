@@ -2,8 +2,8 @@
 #include "hostlib/onvif_camera.h"
 
 #include <curl/curl.h>
-#include <sys/random.h>
 #include <stdlib.h>
+#include <sys/random.h>
 #include <time.h>
 
 #include <atomic>
@@ -77,7 +77,10 @@ class OnvifCamera : public CameraAPI {
 public:
     OnvifCamera(const std::string& host, int port, const std::string& user,
                 const std::string& password, const std::string& channel)
-        : host_(host), port_(port), user_(user), password_(password),
+        : host_(host),
+          port_(port),
+          user_(user),
+          password_(password),
           entry_(EntryFor(host + ":" + std::to_string(port))) {
         long ch = strtol(channel.c_str(), nullptr, 10);
         channel_ = ch > 0 && ch < 1000 ? static_cast<int>(ch) : 1;
@@ -285,9 +288,9 @@ private:
     // One SOAP request to `path` on the configured host and port.
     Outcome Call(const std::string& path, const std::string& body, bool sign, long offset,
                  Reply& reply) {
-        long left = static_cast<long>(std::chrono::duration_cast<std::chrono::milliseconds>(
-                                          deadline_ - Clock::now())
-                                          .count());
+        long left = static_cast<long>(
+            std::chrono::duration_cast<std::chrono::milliseconds>(deadline_ - Clock::now())
+                .count());
         if (left <= 0) return Outcome::kTransport;
         std::string xml;
         if (sign && !user_.empty()) {
@@ -320,8 +323,9 @@ private:
         // learnt (a reset costs every POST an extra wait). Every option that
         // can differ between requests is set below, each time.
 
-        std::string url = "http://" + (host_.find(':') != std::string::npos ? "[" + host_ + "]" : host_) +
-                          ":" + std::to_string(port_) + path;
+        std::string url = "http://" +
+                          (host_.find(':') != std::string::npos ? "[" + host_ + "]" : host_) + ":" +
+                          std::to_string(port_) + path;
         std::string contentType =
             "Content-Type: application/soap+xml; charset=utf-8; action=\"" + ActionOf(body) + "\"";
         struct curl_slist* headers = curl_slist_append(nullptr, contentType.c_str());

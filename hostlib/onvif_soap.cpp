@@ -29,12 +29,23 @@ std::string Escape(const std::string& s) {
     std::string out;
     for (char c : s) {
         switch (c) {
-            case '&': out += "&amp;"; break;
-            case '<': out += "&lt;"; break;
-            case '>': out += "&gt;"; break;
-            case '"': out += "&quot;"; break;
-            case '\'': out += "&apos;"; break;
-            default: out += c;
+            case '&':
+                out += "&amp;";
+                break;
+            case '<':
+                out += "&lt;";
+                break;
+            case '>':
+                out += "&gt;";
+                break;
+            case '"':
+                out += "&quot;";
+                break;
+            case '\'':
+                out += "&apos;";
+                break;
+            default:
+                out += c;
         }
     }
     return out;
@@ -138,8 +149,9 @@ std::string FormatUtc(time_t t) {
 }
 
 std::string Envelope(const std::string& body, const UsernameToken* token) {
-    std::string out = std::string("<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<s:Envelope xmlns:s=\"") +
-                      kNsSoap + "\">";
+    std::string out =
+        std::string("<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<s:Envelope xmlns:s=\"") +
+        kNsSoap + "\">";
     if (token) {
         out += std::string("<s:Header><wsse:Security s:mustUnderstand=\"1\" xmlns:wsse=\"") +
                kNsWsse + "\" xmlns:wsu=\"" + kNsWsu + "\"><wsse:UsernameToken>" +
@@ -156,9 +168,7 @@ std::string Envelope(const std::string& body, const UsernameToken* token) {
     return out;
 }
 
-std::string GetSystemDateAndTimeBody() {
-    return Request("tds", kNsDevice, "GetSystemDateAndTime");
-}
+std::string GetSystemDateAndTimeBody() { return Request("tds", kNsDevice, "GetSystemDateAndTime"); }
 std::string GetServicesBody() {
     return Request("tds", kNsDevice, "GetServices", Element("tds", "IncludeCapability", "false"));
 }
@@ -173,9 +183,9 @@ std::string GetPresetsBody(const std::string& profile) {
     return Request("tptz", kNsPtz, "GetPresets", Element("tptz", "ProfileToken", profile));
 }
 std::string GotoPresetBody(const std::string& profile, const std::string& presetToken) {
-    return Request("tptz", kNsPtz, "GotoPreset",
-                   Element("tptz", "ProfileToken", profile) +
-                       Element("tptz", "PresetToken", presetToken));
+    return Request(
+        "tptz", kNsPtz, "GotoPreset",
+        Element("tptz", "ProfileToken", profile) + Element("tptz", "PresetToken", presetToken));
 }
 
 std::string ActionOf(const std::string& body) {
@@ -193,7 +203,7 @@ std::string ActionOf(const std::string& body) {
 
 struct Reply::Impl {
     pugi::xml_document doc;
-    pugi::xml_node body;     // first element of the Body
+    pugi::xml_node body;  // first element of the Body
 };
 
 Reply::Reply() : impl_(new Impl) {}
@@ -240,8 +250,8 @@ bool Reply::Is(const char* ns, const char* local) const {
 
 std::optional<time_t> Reply::SystemDateAndTimeUtc() const {
     if (!Is(kNsDevice, "GetSystemDateAndTimeResponse")) return std::nullopt;
-    pugi::xml_node utc = Child(Child(impl_->body, kNsDevice, "SystemDateAndTime"), kNsSchema,
-                               "UTCDateTime");
+    pugi::xml_node utc =
+        Child(Child(impl_->body, kNsDevice, "SystemDateAndTime"), kNsSchema, "UTCDateTime");
     pugi::xml_node time = Child(utc, kNsSchema, "Time");
     pugi::xml_node date = Child(utc, kNsSchema, "Date");
     if (!time || !date) return std::nullopt;
@@ -365,9 +375,8 @@ std::optional<Url> ParseUrl(const std::string& url) {
     for (char& c : u.scheme) c = static_cast<char>(tolower(static_cast<unsigned char>(c)));
     size_t hostStart = scheme + 3;
     size_t pathStart = url.find_first_of("/?", hostStart);
-    std::string authority = url.substr(hostStart, pathStart == std::string::npos
-                                                      ? std::string::npos
-                                                      : pathStart - hostStart);
+    std::string authority = url.substr(
+        hostStart, pathStart == std::string::npos ? std::string::npos : pathStart - hostStart);
     size_t at = authority.rfind('@');
     if (at != std::string::npos) authority = authority.substr(at + 1);
     std::string portText;

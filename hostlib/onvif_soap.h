@@ -29,11 +29,11 @@
 
 namespace onvif {
 
-extern const char* const kNsSoap;     // SOAP 1.2 envelope
-extern const char* const kNsSchema;   // tt
-extern const char* const kNsDevice;   // tds
-extern const char* const kNsMedia;    // trt
-extern const char* const kNsPtz;      // tptz
+extern const char* const kNsSoap;    // SOAP 1.2 envelope
+extern const char* const kNsSchema;  // tt
+extern const char* const kNsDevice;  // tds
+extern const char* const kNsMedia;   // trt
+extern const char* const kNsPtz;     // tptz
 
 // ---- requests ----
 
@@ -83,8 +83,8 @@ public:
     struct Addresses {
         std::string media, ptz;  // XAddr as reported; empty when absent
     };
-    Addresses Services() const;       // from GetServicesResponse
-    Addresses Capabilities() const;   // from GetCapabilitiesResponse
+    Addresses Services() const;      // from GetServicesResponse
+    Addresses Capabilities() const;  // from GetCapabilitiesResponse
     struct Profile {
         std::string token, sourceToken;
         int width = 0, height = 0;  // of the video encoder; 0 when absent
@@ -124,8 +124,8 @@ std::map<int, std::string> MapPresets(const std::vector<Reply::Preset>& presets)
 
 struct Url {
     std::string scheme, host;
-    int port = 0;       // the explicit port, else 80 for http and 443 for https
-    std::string path;   // path with query, "/" at least
+    int port = 0;      // the explicit port, else 80 for http and 443 for https
+    std::string path;  // path with query, "/" at least
 };
 std::optional<Url> ParseUrl(const std::string& url);
 

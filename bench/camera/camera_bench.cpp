@@ -148,16 +148,18 @@ private:
 
 }  // namespace
 
-
 int main(int argc, char** argv) {
     setenv("CAMSIM_QUIET", "1", 1);
     benchmark::Initialize(&argc, argv);
     benchmark::RegisterBenchmark("CameraStep/baseline", BareCurlPosts)
-        ->Unit(benchmark::kMicrosecond)->UseRealTime();
+        ->Unit(benchmark::kMicrosecond)
+        ->UseRealTime();
     benchmark::RegisterBenchmark("CameraStep/ours", DriverPresetListAndGoPreset)
-        ->Unit(benchmark::kMicrosecond)->UseRealTime();
+        ->Unit(benchmark::kMicrosecond)
+        ->UseRealTime();
     benchmark::RegisterBenchmark("CameraStep/interleaved", Interleaved)
-        ->Unit(benchmark::kMicrosecond)->UseRealTime();
+        ->Unit(benchmark::kMicrosecond)
+        ->UseRealTime();
     CamSim sim;
     gSim = &sim;
     // Warm the driver's knowledge of the camera, as a running host has it.

@@ -65,7 +65,8 @@ TEST_F(OnvifDriver, PresetsMovesAndSnapshotPath) {
     ASSERT_TRUE(api);
     std::map<int, std::string> presets;
     ASSERT_EQ(api->GetPresetList(presets), 0);
-    EXPECT_EQ(presets, (std::map<int, std::string>{{1, "Home"}, {2, "Door"}, {5, "Gate"}, {9, "Yard"}}));
+    EXPECT_EQ(presets,
+              (std::map<int, std::string>{{1, "Home"}, {2, "Door"}, {5, "Gate"}, {9, "Yard"}}));
 
     EXPECT_EQ(api->GoPreset(5, "kelo5"), 0);
     EXPECT_EQ(api->GoPreset(7, "kelo7"), -1);  // not on the camera
@@ -114,7 +115,8 @@ TEST_F(OnvifDriver, TextTokensMapToStableNegativePositions) {
     std::map<int, std::string> presets;
     ASSERT_EQ(Onvif(sim.Port())->GetPresetList(presets), 0);
     int p1 = onvif::PresetPosition("Preset_1"), p01 = onvif::PresetPosition("01");
-    EXPECT_EQ(presets, (std::map<int, std::string>{{p1, "One"}, {p01, "Zero one"}, {1, "Plain one"}}));
+    EXPECT_EQ(presets,
+              (std::map<int, std::string>{{p1, "One"}, {p01, "Zero one"}, {1, "Plain one"}}));
 
     EXPECT_EQ(Onvif(sim.Port())->GoPreset(p01, "kelo"), 0);
     // Another process knows only the stored position: the driver asks the
@@ -250,7 +252,8 @@ TEST_F(OnvifDriver, ThreadsShareOneCameraSafely) {
         threads.emplace_back([&, t] {
             for (int i = 0; i < 5; ++i) {
                 std::map<int, std::string> presets;
-                if (Onvif(sim.Port())->GetPresetList(presets) != 0 || presets.size() != 4) ++failures;
+                if (Onvif(sim.Port())->GetPresetList(presets) != 0 || presets.size() != 4)
+                    ++failures;
                 if (Onvif(sim.Port())->GoPreset(t % 2 ? 2 : 9, "kelo") != 0) ++failures;
             }
         });

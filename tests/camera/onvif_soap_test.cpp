@@ -1,11 +1,11 @@
 // ONVIF SOAP building and reading: requests as cameras must see them, and
 // replies written the ways different cameras write them.
+#include "hostlib/onvif_soap.h"
+
 #include <gtest/gtest.h>
 #include <limits.h>
 
 #include <pugixml.hpp>
-
-#include "hostlib/onvif_soap.h"
 
 using namespace onvif;
 
@@ -16,9 +16,11 @@ namespace {
 std::string Wrap(const std::string& soap, const std::string& inner) {
     std::string e = soap.empty() ? "Envelope" : soap + ":Envelope";
     std::string b = soap.empty() ? "Body" : soap + ":Body";
-    std::string decl = soap.empty() ? " xmlns=\"http://www.w3.org/2003/05/soap-envelope\""
-                                    : " xmlns:" + soap + "=\"http://www.w3.org/2003/05/soap-envelope\"";
-    return "<?xml version=\"1.0\"?><" + e + decl + "><" + b + ">" + inner + "</" + b + "></" + e + ">";
+    std::string decl = soap.empty()
+                           ? " xmlns=\"http://www.w3.org/2003/05/soap-envelope\""
+                           : " xmlns:" + soap + "=\"http://www.w3.org/2003/05/soap-envelope\"";
+    return "<?xml version=\"1.0\"?><" + e + decl + "><" + b + ">" + inner + "</" + b + "></" + e +
+           ">";
 }
 
 const char* kPresetsTt =
@@ -56,24 +58,28 @@ TEST(OnvifSoap, PresetRepliesReadAlikeWhateverThePrefixes) {
 TEST(OnvifSoap, ElementsAreMatchedByNamespaceNotByPrefix) {
     Reply r;
     // The tptz prefix bound to the wrong namespace: not a PTZ reply.
-    ASSERT_TRUE(r.Parse(Wrap("s", "<tptz:GetPresetsResponse xmlns:tptz=\"urn:other\">"
-                                  "<tptz:Preset token=\"1\"/></tptz:GetPresetsResponse>")));
+    ASSERT_TRUE(r.Parse(Wrap("s",
+                             "<tptz:GetPresetsResponse xmlns:tptz=\"urn:other\">"
+                             "<tptz:Preset token=\"1\"/></tptz:GetPresetsResponse>")));
     EXPECT_TRUE(r.Presets().empty());
     // An unusual prefix bound to the right namespace is fine.
-    ASSERT_TRUE(r.Parse(Wrap("s", "<x:GetPresetsResponse xmlns:x=\"http://www.onvif.org/ver20/"
-                                  "ptz/wsdl\"><x:Preset token=\"3\"/></x:GetPresetsResponse>")));
+    ASSERT_TRUE(r.Parse(Wrap("s",
+                             "<x:GetPresetsResponse xmlns:x=\"http://www.onvif.org/ver20/"
+                             "ptz/wsdl\"><x:Preset token=\"3\"/></x:GetPresetsResponse>")));
     ASSERT_EQ(r.Presets().size(), 1u);
     EXPECT_EQ(r.Presets()[0].token, "3");
     // An empty preset list.
-    ASSERT_TRUE(r.Parse(Wrap("env", "<tptz:GetPresetsResponse xmlns:tptz=\"http://www.onvif.org/"
-                                    "ver20/ptz/wsdl\"/>")));
+    ASSERT_TRUE(r.Parse(Wrap("env",
+                             "<tptz:GetPresetsResponse xmlns:tptz=\"http://www.onvif.org/"
+                             "ver20/ptz/wsdl\"/>")));
     EXPECT_TRUE(r.Is(kNsPtz, "GetPresetsResponse"));
     EXPECT_TRUE(r.Presets().empty());
 }
 
 TEST(OnvifSoap, FaultsAndGarbage) {
     Reply r;
-    ASSERT_TRUE(r.Parse(Wrap("SOAP-ENV",
+    ASSERT_TRUE(r.Parse(Wrap(
+        "SOAP-ENV",
         "<SOAP-ENV:Fault xmlns:ter=\"http://www.onvif.org/ver10/error\"><SOAP-ENV:Code>"
         "<SOAP-ENV:Value>SOAP-ENV:Sender</SOAP-ENV:Value><SOAP-ENV:Subcode><SOAP-ENV:Value>"
         "ter:NotAuthorized</SOAP-ENV:Value></SOAP-ENV:Subcode></SOAP-ENV:Code><SOAP-ENV:Reason>"
@@ -86,9 +92,10 @@ TEST(OnvifSoap, FaultsAndGarbage) {
     EXPECT_FALSE(r.Is(kNsSoap, "Fault"));  // a fault is never a response
 
     // SOAP 1.1 faults from older firmware.
-    ASSERT_TRUE(r.Parse("<soap:Envelope xmlns:soap=\"http://schemas.xmlsoap.org/soap/envelope/\">"
-                        "<soap:Body><soap:Fault><faultcode>soap:Client</faultcode><faultstring>"
-                        "bad</faultstring></soap:Fault></soap:Body></soap:Envelope>"));
+    ASSERT_TRUE(
+        r.Parse("<soap:Envelope xmlns:soap=\"http://schemas.xmlsoap.org/soap/envelope/\">"
+                "<soap:Body><soap:Fault><faultcode>soap:Client</faultcode><faultstring>"
+                "bad</faultstring></soap:Fault></soap:Body></soap:Envelope>"));
     ASSERT_TRUE(r.IsFault());
     EXPECT_EQ(r.GetFault().reason, "bad");
 
@@ -125,32 +132,35 @@ TEST(OnvifSoap, SystemDateAndTime) {
 
 TEST(OnvifSoap, ServiceAddressesFromServicesOrCapabilities) {
     Reply r;
-    ASSERT_TRUE(r.Parse(Wrap("s",
-        "<GetServicesResponse xmlns=\"http://www.onvif.org/ver10/device/wsdl\">"
-        "<Service><Namespace>http://www.onvif.org/ver10/device/wsdl</Namespace><XAddr>"
-        "http://10.0.0.5/onvif/device_service</XAddr></Service>"
-        "<Service><Namespace>http://www.onvif.org/ver20/media/wsdl</Namespace><XAddr>"
-        "http://10.0.0.5/onvif/Media2</XAddr></Service>"
-        "<Service><Namespace>http://www.onvif.org/ver10/media/wsdl</Namespace><XAddr>"
-        " http://10.0.0.5/onvif/Media </XAddr></Service>"
-        "<Service><Namespace>http://www.onvif.org/ver20/ptz/wsdl</Namespace><XAddr>"
-        "http://10.0.0.5/onvif/PTZ</XAddr></Service></GetServicesResponse>")));
+    ASSERT_TRUE(
+        r.Parse(Wrap("s",
+                     "<GetServicesResponse xmlns=\"http://www.onvif.org/ver10/device/wsdl\">"
+                     "<Service><Namespace>http://www.onvif.org/ver10/device/wsdl</Namespace><XAddr>"
+                     "http://10.0.0.5/onvif/device_service</XAddr></Service>"
+                     "<Service><Namespace>http://www.onvif.org/ver20/media/wsdl</Namespace><XAddr>"
+                     "http://10.0.0.5/onvif/Media2</XAddr></Service>"
+                     "<Service><Namespace>http://www.onvif.org/ver10/media/wsdl</Namespace><XAddr>"
+                     " http://10.0.0.5/onvif/Media </XAddr></Service>"
+                     "<Service><Namespace>http://www.onvif.org/ver20/ptz/wsdl</Namespace><XAddr>"
+                     "http://10.0.0.5/onvif/PTZ</XAddr></Service></GetServicesResponse>")));
     EXPECT_EQ(r.Services().media, "http://10.0.0.5/onvif/Media");
     EXPECT_EQ(r.Services().ptz, "http://10.0.0.5/onvif/PTZ");
     EXPECT_TRUE(r.Capabilities().media.empty());
 
-    ASSERT_TRUE(r.Parse(Wrap("SOAP-ENV",
-        "<tds:GetCapabilitiesResponse xmlns:tds=\"http://www.onvif.org/ver10/device/wsdl\" "
-        "xmlns:tt=\"http://www.onvif.org/ver10/schema\"><tds:Capabilities><tt:Media><tt:XAddr>"
-        "http://192.168.1.64:8080/media</tt:XAddr></tt:Media></tds:Capabilities>"
-        "</tds:GetCapabilitiesResponse>")));
+    ASSERT_TRUE(r.Parse(
+        Wrap("SOAP-ENV",
+             "<tds:GetCapabilitiesResponse xmlns:tds=\"http://www.onvif.org/ver10/device/wsdl\" "
+             "xmlns:tt=\"http://www.onvif.org/ver10/schema\"><tds:Capabilities><tt:Media><tt:XAddr>"
+             "http://192.168.1.64:8080/media</tt:XAddr></tt:Media></tds:Capabilities>"
+             "</tds:GetCapabilitiesResponse>")));
     EXPECT_EQ(r.Capabilities().media, "http://192.168.1.64:8080/media");
     EXPECT_EQ(r.Capabilities().ptz, "");
 }
 
 TEST(OnvifSoap, Profiles) {
     Reply r;
-    ASSERT_TRUE(r.Parse(Wrap("env",
+    ASSERT_TRUE(r.Parse(Wrap(
+        "env",
         "<trt:GetProfilesResponse xmlns:trt=\"http://www.onvif.org/ver10/media/wsdl\" "
         "xmlns:tt=\"http://www.onvif.org/ver10/schema\">"
         "<trt:Profiles token=\"main\"><tt:VideoSourceConfiguration token=\"v\"><tt:SourceToken>"
@@ -190,7 +200,8 @@ TEST(OnvifSoap, SignedEnvelope) {
     EXPECT_STREQ(token.child("wsse:Username").text().as_string(), "ad<min&");
     EXPECT_STREQ(token.child("wsse:Password").text().as_string(), "wjpInr7UL0thZOXWecrqoApQnDY=");
     EXPECT_NE(std::string(token.child("wsse:Password").attribute("Type").as_string())
-                  .find("#PasswordDigest"), std::string::npos);
+                  .find("#PasswordDigest"),
+              std::string::npos);
     EXPECT_STREQ(token.child("wsse:Nonce").text().as_string(), "MDEyMzQ1Njc4OWFiY2RlZg==");
     EXPECT_STREQ(token.child("wsu:Created").text().as_string(), "2026-01-02T03:04:05Z");
     pugi::xml_node go = doc.select_node("//*[local-name()='GotoPreset']").node();

@@ -55,10 +55,14 @@ std::vector<std::pair<int, std::string>> Presets(const Patrol& p) {
 
 std::vector<std::string> Stored(int patrolId) {
     std::vector<std::string> out;
-    auto positions = pgtest::Column("SELECT position FROM patrol_preset WHERE patrolId = " +
-                                        itos(patrolId) + " ORDER BY sequence;", "position");
-    auto sequences = pgtest::Column("SELECT sequence FROM patrol_preset WHERE patrolId = " +
-                                        itos(patrolId) + " ORDER BY sequence;", "sequence");
+    auto positions =
+        pgtest::Column("SELECT position FROM patrol_preset WHERE patrolId = " + itos(patrolId) +
+                           " ORDER BY sequence;",
+                       "position");
+    auto sequences =
+        pgtest::Column("SELECT sequence FROM patrol_preset WHERE patrolId = " + itos(patrolId) +
+                           " ORDER BY sequence;",
+                       "sequence");
     for (size_t i = 0; i < positions.size(); ++i) out.push_back(sequences[i] + ":" + positions[i]);
     return out;
 }

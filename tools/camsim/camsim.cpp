@@ -23,6 +23,9 @@
 // service and snapshot addresses, as a camera behind NAT does).
 // GotoPreset carries only a token; every one received is logged on stderr
 // (unless the environment has CAMSIM_QUIET).
+#include "camsim.h"
+
+#include <httplib.h>
 #include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
@@ -30,14 +33,10 @@
 #include <string.h>
 #include <unistd.h>
 
-#include <httplib.h>
-
 #include <memory>
 #include <random>
 #include <sstream>
 #include <thread>
-
-#include "camsim.h"
 
 namespace camsim {
 
@@ -95,10 +94,9 @@ bool DigestOk(State& state, const httplib::Request& req) {
     if (p["username"] != user || p["nonce"].empty()) return false;
     std::string ha1 = Md5Hex(user + ":" + p["realm"] + ":" + password);
     std::string ha2 = Md5Hex(req.method + ":" + p["uri"]);
-    std::string expected =
-        p["qop"].empty() ? Md5Hex(ha1 + ":" + p["nonce"] + ":" + ha2)
-                         : Md5Hex(ha1 + ":" + p["nonce"] + ":" + p["nc"] + ":" + p["cnonce"] +
-                                  ":" + p["qop"] + ":" + ha2);
+    std::string expected = p["qop"].empty() ? Md5Hex(ha1 + ":" + p["nonce"] + ":" + ha2)
+                                            : Md5Hex(ha1 + ":" + p["nonce"] + ":" + p["nc"] + ":" +
+                                                     p["cnonce"] + ":" + p["qop"] + ":" + ha2);
     return expected == p["response"];
 }
 
@@ -112,8 +110,9 @@ void Challenge(httplib::Response& res) {
                  static_cast<unsigned long long>(rng()));
     }
     res.status = 401;
-    res.set_header("WWW-Authenticate", std::string("Digest realm=\"camsim\", qop=\"auth\", nonce=\"") +
-                                           nonce + "\", algorithm=MD5");
+    res.set_header("WWW-Authenticate",
+                   std::string("Digest realm=\"camsim\", qop=\"auth\", nonce=\"") + nonce +
+                       "\", algorithm=MD5");
     res.set_content("Unauthorized\n", "text/plain");
 }
 
@@ -129,7 +128,8 @@ void SendBody(State& state, httplib::Response& res, int status, const std::strin
         bool chunked = delivery == "chunked";
         auto provider = [data, sent, drop, chunked](size_t, httplib::DataSink& sink) {
             for (size_t off = 0; off < sent; off += 1024)
-                if (!sink.write(data->data() + off, std::min<size_t>(1024, sent - off))) return false;
+                if (!sink.write(data->data() + off, std::min<size_t>(1024, sent - off)))
+                    return false;
             if (drop) return false;
             // Without a length the end of the body is the close; the server
             // library would keep the connection open after done(), so the
@@ -176,7 +176,8 @@ void Serve(State& state, httplib::Server& svr) {
             ++state.requests;
         }
         long delay = atol(state.Fault("delay_ms").c_str());
-        if (delay > 0) std::this_thread::sleep_for(std::chrono::milliseconds(std::min(delay, 60000L)));
+        if (delay > 0)
+            std::this_thread::sleep_for(std::chrono::milliseconds(std::min(delay, 60000L)));
         int status = atoi(state.Fault("status").c_str());
         if (status > 0) {
             res.status = status;
@@ -219,8 +220,10 @@ void Serve(State& state, httplib::Server& svr) {
                     if (i > 0) std::this_thread::sleep_for(std::chrono::milliseconds(100));
                     std::string jpeg = PresetJpeg(CurrentToken(*s), 160, 90);
                     // Even frames carry a Content-Length, odd ones only the boundary.
-                    std::string part = std::string("--") + kBoundary + "\r\nContent-Type: image/jpeg\r\n";
-                    if (i % 2 == 0) part += "Content-Length: " + std::to_string(jpeg.size()) + "\r\n";
+                    std::string part =
+                        std::string("--") + kBoundary + "\r\nContent-Type: image/jpeg\r\n";
+                    if (i % 2 == 0)
+                        part += "Content-Length: " + std::to_string(jpeg.size()) + "\r\n";
                     part += "\r\n" + jpeg + "\r\n";
                     size_t n = (drop && i == 1) ? part.size() / 2 : part.size();
                     if (!sink.is_writable() || !sink.write(part.data(), n)) return false;
