@@ -4,7 +4,8 @@
 #define TESTS_EXECUTOR_EXECUTOR_TEST_UTIL_H
 
 #include <chrono>
-#include <regex>
+#include <algorithm>
+#include <cctype>
 #include <string>
 #include <vector>
 
@@ -88,7 +89,10 @@ inline bool Logged(const std::string& file, const std::string& function,
         if (text.rfind(prefix, 0) != 0 || text.size() < prefix.size() + suffix.size()) continue;
         if (text.compare(text.size() - suffix.size(), suffix.size(), suffix) != 0) continue;
         const std::string line = text.substr(prefix.size(), text.size() - prefix.size() - suffix.size());
-        if (!line.empty() && std::regex_match(line, std::regex("[0-9]+"))) return true;
+        if (!line.empty() && std::all_of(line.begin(), line.end(),
+                                         [](unsigned char c) { return std::isdigit(c) != 0; })) {
+            return true;
+        }
     }
     return false;
 }
