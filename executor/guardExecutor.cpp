@@ -50,7 +50,15 @@ int GuardExecutor::Init(PatrolExecutor* executor, int repeatCount, int pauseMinu
     this->eventValidSeconds = eventValidSeconds;
     pthread_mutex_init(&mutex, nullptr);
     started = true;
-    pthread_create(&thread, nullptr, ThreadFuncExcute, this);
+    const int rc = pthread_create(&thread, nullptr, ThreadFuncExcute, this);
+    if (rc != 0) {
+        // Without a thread there is nothing to terminate: report the failure.
+        GUARD_LOG("Create guard thread failed: %d.", rc);
+        started = false;
+        pthread_mutex_destroy(&mutex);
+        this->executor = nullptr;
+        return -1;
+    }
     return 0;
 }
 

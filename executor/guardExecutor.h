@@ -63,7 +63,7 @@ public:
     // start (0 or less: without end); `pauseMinutes`: the pause after the runs
     // in continuous mode; `eventValidSeconds`: how old an event's timestamp may
     // be (negative values count as 0). 0: started; -2: null executor (no
-    // thread); -1: already started.
+    // thread); -1: already started, or the thread could not be created (logged).
     int Init(PatrolExecutor* executor, int repeatCount, int pauseMinutes, int eventValidSeconds);
     // Judges the schedule entry in force and the two events, and posts START
     // or STOP when the command slot is empty.

@@ -29,16 +29,19 @@ PatrolExecutor::PatrolExecutor()
       status(PATROL_STATUS_IDLE),
       execType(PATROL_EXEC_NONE),
       command(PATROL_CMD_NONE),
-      thread() {
+      thread(),
+      threadStarted(false) {
     pthread_mutex_init(&mutex, nullptr);
-    pthread_create(&thread, nullptr, ThreadFuncExcute, this);
+    const int rc = pthread_create(&thread, nullptr, ThreadFuncExcute, this);
+    threadStarted = (rc == 0);
+    if (!threadStarted) EXECUTOR_LOG("Create worker thread failed: %d.", rc);
 }
 
 PatrolExecutor::~PatrolExecutor() {
     pthread_mutex_lock(&mutex);
     command = PATROL_CMD_EXIT;
     pthread_mutex_unlock(&mutex);
-    pthread_join(thread, nullptr);
+    if (threadStarted) pthread_join(thread, nullptr);
     DestroyLock(&mutex);
 }
 

@@ -44,7 +44,8 @@ enum {
 // joins the worker; nobody may post to the executor once it has begun.
 class PTZ_EXPORT PatrolExecutor {
 public:
-    // Starts the worker thread.
+    // Starts the worker thread. If the thread cannot be created (logged), the
+    // executor stays idle and accepts requests that nothing serves.
     PatrolExecutor();
     // Stops and joins the worker (after the camera call in progress, if any).
     ~PatrolExecutor();
@@ -98,6 +99,9 @@ private:
     // Guards requestId and command only; held for a few stores, nothing is
     // called while it is held.
     pthread_mutex_t mutex;
+    // Whether pthread_create succeeded (the destructor joins only a started
+    // worker). Set by the constructor only.
+    bool threadStarted;
 };
 
 #endif  // EXECUTOR_PATROLEXECUTOR_H

@@ -366,3 +366,42 @@ TEST_F(PatrolExecutorTest, ConcurrentPostersLeaveAConsistentExecutor) {
 }
 
 }  // namespace
+
+#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
+#include <sys/resource.h>
+
+namespace {
+
+// Address space of this process in bytes (VmSize).
+size_t AddressSpace() {
+    FILE* f = fopen("/proc/self/statm", "r");
+    unsigned long pages = 0;
+    if (f != nullptr) {
+        if (fscanf(f, "%lu", &pages) != 1) pages = 0;
+        fclose(f);
+    }
+    return pages * static_cast<size_t>(sysconf(_SC_PAGESIZE));
+}
+
+// A worker that cannot be created (no room for its stack, as in a crowded
+// 32-bit process) is reported, and the destructor does not join it.
+TEST_F(PatrolExecutorTest, WorkerThatCannotBeCreatedIsReportedAndNotJoined) {
+    struct rlimit old;
+    ASSERT_EQ(getrlimit(RLIMIT_AS, &old), 0);
+    struct rlimit tight = old;
+    tight.rlim_cur = AddressSpace() + (2u << 20);  // less than one default thread stack
+    ASSERT_EQ(setrlimit(RLIMIT_AS, &tight), 0);
+    auto executor = std::make_unique<PatrolExecutor>();
+    ASSERT_EQ(setrlimit(RLIMIT_AS, &old), 0);
+    if (fake::LogTexts().empty()) {
+        // The C library reused the stack of an earlier thread of this process.
+        GTEST_SKIP() << "thread created from a cached stack";
+    }
+    EXPECT_TRUE(Logged(kFile, "PatrolExecutor", "Create worker thread failed: 11."));
+    EXPECT_EQ(executor->Execute(1, PATROL_EXEC_DIRECT), 0);
+    EXPECT_EQ(executor->GetStatus(), PATROL_STATUS_IDLE);
+    executor.reset();
+}
+
+}  // namespace
+#endif
