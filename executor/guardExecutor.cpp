@@ -34,6 +34,7 @@ GuardExecutor::GuardExecutor(int guardId)
       executor(nullptr),
       thread(),
       mutex(),
+      wake(),
       started(false) {}
 
 GuardExecutor::~GuardExecutor() {
@@ -49,6 +50,7 @@ int GuardExecutor::Init(PatrolExecutor* executor, int repeatCount, int pauseMinu
     this->pauseMinutes = pauseMinutes;
     this->eventValidSeconds = eventValidSeconds;
     pthread_mutex_init(&mutex, nullptr);
+    pthread_cond_init(&wake, nullptr);
     started = true;
     const int rc = pthread_create(&thread, nullptr, ThreadFuncExcute, this);
     if (rc != 0) {
@@ -56,6 +58,7 @@ int GuardExecutor::Init(PatrolExecutor* executor, int repeatCount, int pauseMinu
         GUARD_LOG("Create guard thread failed: %d.", rc);
         started = false;
         pthread_mutex_destroy(&mutex);
+        pthread_cond_destroy(&wake);
         this->executor = nullptr;
         return -1;
     }
@@ -108,10 +111,15 @@ void GuardExecutor::AnalyzeSchedule(EVENT_STATUS first, EVENT_STATUS second,
         }
     }
 
+    bool posted = false;
     pthread_mutex_lock(&mutex);
     pending = info;
-    if (command == GUARD_CMD_NONE) command = decision;  // never overwrite an untaken command
+    if (command == GUARD_CMD_NONE && decision != GUARD_CMD_NONE) {  // never overwrite a command
+        command = decision;
+        posted = true;
+    }
     pthread_mutex_unlock(&mutex);
+    if (posted) pthread_cond_signal(&wake);
 }
 
 int GuardExecutor::Terminate() {
@@ -119,8 +127,10 @@ int GuardExecutor::Terminate() {
     pthread_mutex_lock(&mutex);
     command = GUARD_CMD_TERMINATE;
     pthread_mutex_unlock(&mutex);
+    pthread_cond_signal(&wake);
     pthread_join(thread, nullptr);
     DestroyLock(&mutex);
+    pthread_cond_destroy(&wake);
     started = false;
     return 0;
 }
@@ -210,6 +220,20 @@ int GuardExecutor::ExcuteMain() {
                 GUARD_LOG("Error command: %d.", taken);
                 break;
         }
-        pacer.Delay();
+
+        // Idle with no command: the passes would do nothing, so sleep until
+        // a command is posted and act on it at once, on a new grid.
+        bool waited = false;
+        pthread_mutex_lock(&mutex);
+        while (command == GUARD_CMD_NONE && state.load() == GUARD_STATE_IDLE) {
+            pthread_cond_wait(&wake, &mutex);
+            waited = true;
+        }
+        pthread_mutex_unlock(&mutex);
+        if (waited) {
+            pacer.BeginTiming();
+        } else {
+            pacer.Delay();
+        }
     }
 }

@@ -45,7 +45,8 @@ enum {
 enum { GUARD_CMD_NONE = 0, GUARD_CMD_START = 1, GUARD_CMD_STOP = 2, GUARD_CMD_TERMINATE = 3 };
 
 // Drives a bound PatrolExecutor with guard requests from its own thread, which
-// makes one pass every 250 ms. It never talks to a camera.
+// makes one pass every 250 ms unless it is idle (then it sleeps until a
+// command is posted). It never talks to a camera.
 //
 // Lifecycle: construct, Init (starts the thread), AnalyzeSchedule as often as
 // wanted from any thread, Terminate (joins the thread). The executor is not
@@ -99,6 +100,9 @@ private:
     // Guards pending, command and current's writes; held for a few stores,
     // nothing called inside, never nested with the executor's mutex.
     pthread_mutex_t mutex;
+    // Signalled after each post; the thread, idle with no command, sleeps on
+    // it (with mutex) instead of making empty passes.
+    pthread_cond_t wake;
     bool started;  // Init started the thread and Terminate has not joined it (host threads)
 };
 

@@ -32,6 +32,7 @@ PatrolExecutor::PatrolExecutor()
       thread(),
       threadStarted(false) {
     pthread_mutex_init(&mutex, nullptr);
+    pthread_cond_init(&wake, nullptr);
     const int rc = pthread_create(&thread, nullptr, ThreadFuncExcute, this);
     threadStarted = (rc == 0);
     if (!threadStarted) EXECUTOR_LOG("Create worker thread failed: %d.", rc);
@@ -41,8 +42,10 @@ PatrolExecutor::~PatrolExecutor() {
     pthread_mutex_lock(&mutex);
     command = PATROL_CMD_EXIT;
     pthread_mutex_unlock(&mutex);
+    pthread_cond_signal(&wake);
     if (threadStarted) pthread_join(thread, nullptr);
     DestroyLock(&mutex);
+    pthread_cond_destroy(&wake);
 }
 
 int PatrolExecutor::Execute(int patrolId, PATROL_EXEC_TYPE type) {
@@ -51,6 +54,7 @@ int PatrolExecutor::Execute(int patrolId, PATROL_EXEC_TYPE type) {
     command = PATROL_CMD_EXECUTE;
     requestId[type] = patrolId;
     pthread_mutex_unlock(&mutex);
+    pthread_cond_signal(&wake);
     return 0;
 }
 
@@ -60,6 +64,7 @@ int PatrolExecutor::RemovePatrol(PATROL_EXEC_TYPE type) {
     command = (type == PATROL_EXEC_GUARD) ? PATROL_CMD_REMOVE_GUARD : PATROL_CMD_REMOVE_DIRECT;
     requestId[type] = 0;
     pthread_mutex_unlock(&mutex);
+    pthread_cond_signal(&wake);
     return 0;
 }
 
@@ -221,7 +226,21 @@ int PatrolExecutor::ExcuteMain() {
                 EXECUTOR_LOG("Error command: %d.", taken);
                 break;
         }
-        pacer.Delay();
+
+        // Idle with no command: the passes would do nothing, so sleep until
+        // a command is posted and act on it at once, on a new grid.
+        bool waited = false;
+        pthread_mutex_lock(&mutex);
+        while (command == PATROL_CMD_NONE && status.load() == PATROL_STATUS_IDLE) {
+            pthread_cond_wait(&wake, &mutex);
+            waited = true;
+        }
+        pthread_mutex_unlock(&mutex);
+        if (waited) {
+            pacer.BeginTiming();
+        } else {
+            pacer.Delay();
+        }
     }
 }
 

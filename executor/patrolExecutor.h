@@ -34,10 +34,12 @@ enum {
     PATROL_CMD_REMOVE_GUARD = 4
 };
 
-// Runs at most one patrol at a time on its own worker thread, which makes one
-// pass every 250 ms: it takes the command, loads the requested patrol, and
-// sends the camera from preset to preset ("kelo<position>"), waiting the
-// patrol's stay time at each, then back to the first preset, and the run ends.
+// Runs at most one patrol at a time on its own worker thread. While a run is
+// in progress the worker makes one pass every 250 ms; an idle worker sleeps
+// until a command is posted and acts on it at once. A pass takes the command,
+// loads the requested patrol, and sends the camera from preset to preset
+// ("kelo<position>"), waiting the patrol's stay time at each, then back to
+// the first preset, and the run ends.
 //
 // Thread-safety: Execute, RemovePatrol and GetStatus may be called from any
 // thread; none of them waits for the worker. The destructor posts EXIT and
@@ -99,6 +101,9 @@ private:
     // Guards requestId and command only; held for a few stores, nothing is
     // called while it is held.
     pthread_mutex_t mutex;
+    // Signalled after each post; an idle worker with no command sleeps on it
+    // (with mutex) instead of making empty passes.
+    pthread_cond_t wake;
     // Whether pthread_create succeeded (the destructor joins only a started
     // worker). Set by the constructor only.
     bool threadStarted;

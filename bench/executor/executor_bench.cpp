@@ -1,9 +1,10 @@
 // Executor benchmarks, one pass each (figures as counters):
 //  - IdleExecutors/500: CPU of 500 idle executors over 10 s, resident and
 //    virtual memory per executor, and the default stack a worker reserves;
-//  - ExecuteToFirstMove: delay from Execute to the camera simulator receiving
-//    the first move, next to its parts measured in the same run (the load of
-//    the patrol and one camera call), against the goal of one 250 ms pass;
+//  - ExecuteToFirstMove: delay from Execute (at a random moment) to the camera
+//    simulator receiving the first move, next to its parts measured in the
+//    same run (the load of the patrol and one camera call); the goal is at
+//    most one 250 ms pass beyond them;
 //  - Guards/256: 256 guards bound to 256 executors, idle, then in continuous
 //    mode on a patrol whose camera refuses connections.
 // The patrol store is a throwaway PostgreSQL cluster started here
@@ -178,23 +179,33 @@ void BM_ExecuteToFirstMove(benchmark::State& state) {
     world.AddCamera(camId, world.Sim().Port());
     const int id = world.StorePatrol(camId, 60, {5, 2, 9});
 
-    // Baselines in the same run: one camera call, and one load of the patrol.
+    // Baselines in the same run, medians after a warm-up (the driver's first
+    // call discovers the camera): one camera call, and one load of the patrol.
     const int samples = 20;
-    double callMs = 0, loadMs = 0;
-    for (int i = 0; i < samples; ++i) {
+    std::vector<double> calls, loads;
+    for (int i = 0; i <= samples; ++i) {
+        // Apart from each other, as the executor's calls are: back-to-back
+        // requests on one kept connection can meet the 40 ms delayed ACK.
+        std::this_thread::sleep_for(50ms);
         auto t0 = Clock::now();
         CameraAPI* api =
             newCameraAPI("127.0.0.1", world.Sim().Port(), "admin", "secret", "onvif", "", "");
         api->GoPreset(1, "kelo1");
         releaseCameraAPI(api);
-        callMs += std::chrono::duration<double, std::milli>(Clock::now() - t0).count();
+        const double call = std::chrono::duration<double, std::milli>(Clock::now() - t0).count();
+        std::this_thread::sleep_for(50ms);
         t0 = Clock::now();
         Patrol p;
         p.Load(id);
-        loadMs += std::chrono::duration<double, std::milli>(Clock::now() - t0).count();
+        const double load = std::chrono::duration<double, std::milli>(Clock::now() - t0).count();
+        if (i == 0) continue;
+        calls.push_back(call);
+        loads.push_back(load);
     }
-    callMs /= samples;
-    loadMs /= samples;
+    std::sort(calls.begin(), calls.end());
+    std::sort(loads.begin(), loads.end());
+    const double callMs = calls[calls.size() / 2];
+    const double loadMs = loads[loads.size() / 2];
 
     PatrolExecutor executor;
     std::mt19937 rng(1);

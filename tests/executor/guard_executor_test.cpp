@@ -18,6 +18,7 @@ struct GuardExecutorPeer {
         g.pauseMinutes = pauseMinutes;
         g.eventValidSeconds = eventValidSeconds;
         pthread_mutex_init(&g.mutex, nullptr);
+        pthread_cond_init(&g.wake, nullptr);
         g.started = true;
     }
     static void StartThread(GuardExecutor& g) {
@@ -25,6 +26,7 @@ struct GuardExecutorPeer {
     }
     static void Unprepare(GuardExecutor& g) {
         pthread_mutex_destroy(&g.mutex);
+        pthread_cond_destroy(&g.wake);
         g.started = false;
     }
     static int Command(GuardExecutor& g) {
