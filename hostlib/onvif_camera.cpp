@@ -2,7 +2,7 @@
 #include "hostlib/onvif_camera.h"
 
 #include <curl/curl.h>
-#include <openssl/rand.h>
+#include <sys/random.h>
 #include <stdlib.h>
 #include <time.h>
 
@@ -68,7 +68,10 @@ size_t Collect(char* data, size_t size, size_t n, void* out) {
     return size * n;
 }
 
-enum class Outcome { kOk, kTransport, kRefused };
+// kRefused: the camera failed the request (a fault, an error status, a reply
+// we cannot read), which kept knowledge may explain; kAbsent: the camera's
+// own fresh answer says the thing asked for does not exist.
+enum class Outcome { kOk, kTransport, kRefused, kAbsent };
 
 class OnvifCamera : public CameraAPI {
 public:
@@ -138,7 +141,7 @@ public:
                     Outcome o = FetchPresets(d, list);
                     if (o != Outcome::kOk) return o;
                     it = d.textTokens.find(position);
-                    if (it == d.textTokens.end()) return Outcome::kRefused;
+                    if (it == d.textTokens.end()) return Outcome::kAbsent;
                 }
                 token = it->second;
             }
@@ -169,6 +172,7 @@ private:
         }
         Outcome o = op(d);
         if (o == Outcome::kOk) return 0;
+        if (o == Outcome::kAbsent) return -1;
         Forget();
         if (fresh || o == Outcome::kTransport) return -1;
         d = Discovery();
@@ -290,8 +294,11 @@ private:
             UsernameToken token;
             token.user = user_;
             token.password = password_;
+            // The kernel's random bytes: a fresh, unpredictable nonce without
+            // the cost of a user-space generator per request.
             unsigned char nonce[16];
-            if (RAND_bytes(nonce, sizeof nonce) != 1) return Outcome::kRefused;
+            if (getrandom(nonce, sizeof nonce, 0) != static_cast<ssize_t>(sizeof nonce))
+                return Outcome::kRefused;
             token.nonce.assign(reinterpret_cast<char*>(nonce), sizeof nonce);
             token.created = FormatUtc(time(nullptr) + offset);
             xml = Envelope(body, &token);
@@ -309,7 +316,9 @@ private:
         }
         if (!curl) curl = curl_easy_init();
         if (!curl) return Outcome::kTransport;
-        curl_easy_reset(curl);
+        // A kept handle is not reset: it keeps what HTTP authentication
+        // learnt (a reset costs every POST an extra wait). Every option that
+        // can differ between requests is set below, each time.
 
         std::string url = "http://" + (host_.find(':') != std::string::npos ? "[" + host_ + "]" : host_) +
                           ":" + std::to_string(port_) + path;
@@ -332,10 +341,18 @@ private:
             curl_easy_setopt(curl, CURLOPT_HTTPAUTH, CURLAUTH_DIGEST | CURLAUTH_BASIC);
             curl_easy_setopt(curl, CURLOPT_USERNAME, user_.c_str());
             curl_easy_setopt(curl, CURLOPT_PASSWORD, password_.c_str());
+        } else {
+            curl_easy_setopt(curl, CURLOPT_HTTPAUTH, CURLAUTH_NONE);
+            curl_easy_setopt(curl, CURLOPT_USERNAME, static_cast<char*>(nullptr));
+            curl_easy_setopt(curl, CURLOPT_PASSWORD, static_cast<char*>(nullptr));
         }
         CURLcode rc = curl_easy_perform(curl);
         long status = 0;
         curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
+        // No pointer into this call's buffers stays in a kept handle.
+        curl_easy_setopt(curl, CURLOPT_HTTPHEADER, static_cast<curl_slist*>(nullptr));
+        curl_easy_setopt(curl, CURLOPT_POSTFIELDS, static_cast<char*>(nullptr));
+        curl_easy_setopt(curl, CURLOPT_WRITEDATA, static_cast<void*>(nullptr));
         curl_slist_free_all(headers);
         {
             std::lock_guard<std::mutex> lock(entry_->mu);

@@ -26,14 +26,16 @@
 // Preset positions: see onvif_soap.h (decimal tokens are their number, other
 // tokens a stable negative number). GoPreset with a negative position looks
 // its token up in the camera's preset list; a position the camera does not
-// have is a failure. GotoPreset returns before the camera arrives.
+// have is a failure. GotoPreset carries only the preset token: GoPreset's
+// name argument is not sent. GotoPreset returns before the camera arrives.
 //
 // Every CameraAPI call is bounded by CallTimeoutMs() in all (connect, all its
 // requests). What is discovered about a camera (service paths, profiles,
 // clock offset, the tokens of text presets, snapshot URIs) and its open HTTP
 // connections are kept per "host:port" across control objects, thread-safely,
 // and forgotten when a call fails; a call that failed on what was kept
-// discovers afresh and tries once more (within the same time bound). So with
+// discovers afresh and tries once more (within the same time bound; not when
+// the camera's fresh preset list lacks the position asked for). So with
 // a warm cache GetPresetList and GoPreset each cost one round trip.
 #ifndef HOSTLIB_ONVIF_CAMERA_H
 #define HOSTLIB_ONVIF_CAMERA_H

@@ -120,10 +120,13 @@ std::string Base64(const std::string& bytes) {
 
 std::string PasswordDigest(const std::string& nonce, const std::string& created,
                            const std::string& password) {
+    // The digest is fetched once: a fetch per call costs more than the hash.
+    static EVP_MD* const sha1 = EVP_MD_fetch(nullptr, "SHA1", nullptr);
     std::string input = nonce + created + password;
     unsigned char d[SHA_DIGEST_LENGTH];
-    SHA1(reinterpret_cast<const unsigned char*>(input.data()), input.size(), d);
-    return Base64(std::string(reinterpret_cast<char*>(d), sizeof d));
+    unsigned int len = 0;
+    if (!sha1 || !EVP_Digest(input.data(), input.size(), d, &len, sha1, nullptr)) return "";
+    return Base64(std::string(reinterpret_cast<char*>(d), len));
 }
 
 std::string FormatUtc(time_t t) {

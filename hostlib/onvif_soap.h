@@ -95,7 +95,8 @@ public:
     struct Preset {
         std::string token, name;
     };
-    std::vector<Preset> Presets() const;  // presets without a token are left out
+    // Presets without a token, or with one longer than 64 characters, are left out.
+    std::vector<Preset> Presets() const;
     // true when the body is the response element `local` in namespace `ns`.
     bool Is(const char* ns, const char* local) const;
 

@@ -63,6 +63,31 @@ TEST(CamSim, MovesAreLoggedWithTheSimulatorsClock) {
     EXPECT_TRUE(sim.Moves().empty());
 }
 
+std::string Ptz(const std::string& inner) {
+    return "<s:Envelope xmlns:s=\"http://www.w3.org/2003/05/soap-envelope\"><s:Body>" + inner +
+           "</s:Body></s:Envelope>";
+}
+
+TEST(CamSim, SetAndRemovePresetsOverOnvif) {
+    CamSim sim;
+    const std::string ns = " xmlns=\"http://www.onvif.org/ver20/ptz/wsdl\"";
+    Reply set = Fetch(sim.Port(), "/onvif/ptz_service",
+                      Ptz("<SetPreset" + ns + "><ProfileToken>Profile_1_main</ProfileToken>"
+                          "<PresetName>Porch</PresetName></SetPreset>"));
+    ASSERT_EQ(set.status, 200) << set.body;
+    EXPECT_NE(set.body.find("<tptz:PresetToken>3</tptz:PresetToken>"), std::string::npos);
+    EXPECT_EQ(Fetch(sim.Port(), "/onvif/ptz_service",
+                    Ptz("<RemovePreset" + ns + "><ProfileToken>Profile_1_main</ProfileToken>"
+                        "<PresetToken>2</PresetToken></RemovePreset>")).status, 200);
+    Reply list = Fetch(sim.Port(), "/onvif/ptz_service",
+                       Ptz("<GetPresets" + ns + "><ProfileToken>Profile_1_main</ProfileToken>"
+                           "</GetPresets>"));
+    EXPECT_NE(list.body.find("token=\"3\"><tt:Name>Porch</tt:Name>"), std::string::npos);
+    EXPECT_EQ(list.body.find("token=\"2\""), std::string::npos);
+    EXPECT_EQ(Fetch(sim.Port(), "/onvif/ptz_service", Goto("2")).status, 400);
+    EXPECT_EQ(Fetch(sim.Port(), "/onvif/ptz_service", Goto("3")).status, 200);
+}
+
 TEST(CamSim, RequiresCredentialsExceptOnControlEndpoints) {
     CamSim::Options o;
     o.password = "other";

@@ -122,7 +122,10 @@ TEST_F(OnvifDriver, TextTokensMapToStableNegativePositions) {
     onvif::ForgetCameras();
     EXPECT_EQ(Onvif(sim.Port())->GoPreset(p1, "kelo"), 0);
     EXPECT_EQ(Onvif(sim.Port())->GoPreset(1, "kelo1"), 0);
+    // A text position the camera does not have: one look at its list, no move.
+    long before = Requests(sim.Port());
     EXPECT_EQ(Onvif(sim.Port())->GoPreset(onvif::PresetPosition("Preset_2"), "kelo"), -1);
+    EXPECT_EQ(Requests(sim.Port()) - before, 1);
     EXPECT_EQ(Tokens(sim), (std::vector<std::string>{"01", "Preset_1", "1"}));
 }
 

@@ -21,7 +21,8 @@
 // clock_skew_s, no_get_services, no_get_capabilities, alt_paths
 // (/onvif/Media, /onvif/PTZ), internal_address ("host:port" reported in
 // service and snapshot addresses, as a camera behind NAT does).
-// GotoPreset carries only a token; every one received is logged on stderr.
+// GotoPreset carries only a token; every one received is logged on stderr
+// (unless the environment has CAMSIM_QUIET).
 #include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
@@ -164,6 +165,9 @@ std::string CurrentToken(State& state) {
 
 void Serve(State& state, httplib::Server& svr) {
     svr.new_task_queue = [] { return new httplib::ThreadPool(32); };
+    // Headers and body go out in separate writes; without this, Nagle and the
+    // client's delayed ACK add ~40 ms to every reply.
+    svr.set_tcp_nodelay(true);
 
     svr.set_pre_routing_handler([&state](const httplib::Request& req, httplib::Response& res) {
         if (IsControl(req.path)) return httplib::Server::HandlerResponse::Unhandled;

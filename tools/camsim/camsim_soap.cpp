@@ -387,7 +387,8 @@ SoapReply GetPresets(State& state, pugi::xml_node request) {
 SoapReply GotoPreset(State& state, pugi::xml_node request) {
     if (!PtzProfile(request)) return NoPtzProfile(state);
     std::string token = ChildText(request, "PresetToken");
-    fprintf(stderr, "camsim: GotoPreset token=\"%s\"\n", token.c_str());
+    static const bool quiet = getenv("CAMSIM_QUIET") != nullptr;
+    if (!quiet) fprintf(stderr, "camsim: GotoPreset token=\"%s\"\n", token.c_str());
     if (!token.empty() && token == state.Fault("refuse"))
         return Fault(state, 500, "env:Receiver", "ter:Action", "Preset refused");
     std::lock_guard<std::mutex> lock(state.mu);
