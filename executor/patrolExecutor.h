@@ -65,8 +65,6 @@ public:
     int GetStatus();
 
 private:
-    friend struct PatrolExecutorPeer;  // unit tests reach single moves through it
-
     static void* ThreadFuncExcute(void* arg);
     // The worker loop; 0 when it leaves on EXIT.
     int ExcuteMain();

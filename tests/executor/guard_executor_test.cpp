@@ -89,104 +89,83 @@ protected:
     void SetUp() override { fake::Reset(); }
 };
 
-TEST_F(GuardExecutorTest, InitWithoutExecutorStartsNothing) {
-    GuardExecutor guard(1);
-    EXPECT_EQ(guard.Init(nullptr, 1, 1, 10), -2);
-    EXPECT_EQ(guard.Terminate(), -1);
-    guard.AnalyzeSchedule(Present(), Present(), {5, GUARD_MODE_CONTINUOUS});  // ignored
-    EXPECT_EQ(Peer::State(guard), GUARD_STATE_IDLE);
+TEST_F(GuardExecutorTest, Lifecycle) {
+    GuardExecutor unbound(1);
+    EXPECT_EQ(unbound.Init(nullptr, 1, 1, 10), -2);
+    EXPECT_EQ(unbound.Terminate(), -1);  // no thread to join
+    unbound.AnalyzeSchedule(Present(), Present(), {5, GUARD_MODE_CONTINUOUS});  // ignored
+
+    PatrolExecutor executor;
+    GuardExecutor forgotten(2);
+    ASSERT_EQ(forgotten.Init(&executor, 1, 1, 10), 0);
+    EXPECT_EQ(forgotten.Init(&executor, 1, 1, 10), -1);  // one thread per guard
+    // Not terminated by the host: the destructor joins the thread.
 }
 
 // The decision of AnalyzeSchedule, with the command slot held (no thread).
 TEST_F(GuardExecutorTest, DecisionTable) {
+    enum { OFF, CONT, FIRST, SECOND, ANY };
+    enum { IDLE, RUNNING, INTERVAL, HOLDOFF };
+    enum { NONE, START, STOP };
+    const EVENT_STATUS on = Present(), off = Absent();
+    const EVENT_STATUS expired = Event(1, 20);  // validity is 10 s
+    const EVENT_STATUS ahead = Event(1, -5);    // beyond the 1 s tolerance
     struct Case {
-        const char* what;
         int state;
         GuardScheduleInfo current;
         EVENT_STATUS first, second;
         GuardScheduleInfo info;
         int expected;
-    };
-    const GuardScheduleInfo none{0, GUARD_MODE_OFF};
-    const EVENT_STATUS expired = Event(1, 20);  // validity is 10 s
-    const EVENT_STATUS future = Event(1, -5);   // beyond the 1 s tolerance
-    const Case cases[] = {
-        {"off, idle", GUARD_STATE_IDLE, none, Present(), Present(), {5, GUARD_MODE_OFF},
-         GUARD_CMD_NONE},
-        {"continuous, idle", GUARD_STATE_IDLE, none, Absent(), Absent(),
-         {5, GUARD_MODE_CONTINUOUS}, GUARD_CMD_START},
-        {"first present", GUARD_STATE_IDLE, none, Present(), Absent(),
-         {5, GUARD_MODE_FIRST_EVENT}, GUARD_CMD_START},
-        {"first inactive", GUARD_STATE_IDLE, none, Absent(), Present(),
-         {5, GUARD_MODE_FIRST_EVENT}, GUARD_CMD_NONE},
-        {"first active but expired", GUARD_STATE_IDLE, none, expired, Absent(),
-         {5, GUARD_MODE_FIRST_EVENT}, GUARD_CMD_NONE},
-        {"first active but in the future", GUARD_STATE_IDLE, none, future, Absent(),
-         {5, GUARD_MODE_FIRST_EVENT}, GUARD_CMD_NONE},
-        {"second present", GUARD_STATE_IDLE, none, Absent(), Present(),
-         {5, GUARD_MODE_SECOND_EVENT}, GUARD_CMD_START},
-        {"second: only first present", GUARD_STATE_IDLE, none, Present(), expired,
-         {5, GUARD_MODE_SECOND_EVENT}, GUARD_CMD_NONE},
-        {"any: only second present", GUARD_STATE_IDLE, none, Absent(), Present(),
-         {5, GUARD_MODE_ANY_EVENT}, GUARD_CMD_START},
-        {"any: only first present", GUARD_STATE_IDLE, none, Present(), Absent(),
-         {5, GUARD_MODE_ANY_EVENT}, GUARD_CMD_START},
-        {"any: both expired", GUARD_STATE_IDLE, none, expired, expired, {5, GUARD_MODE_ANY_EVENT},
-         GUARD_CMD_NONE},
-        {"unknown mode", GUARD_STATE_IDLE, none, Present(), Present(), {5, 9}, GUARD_CMD_NONE},
-        {"continuous while running the same entry", GUARD_STATE_RUNNING,
-         {5, GUARD_MODE_CONTINUOUS}, Absent(), Absent(), {5, GUARD_MODE_CONTINUOUS},
-         GUARD_CMD_NONE},
-        {"other patrol while running", GUARD_STATE_RUNNING, {5, GUARD_MODE_CONTINUOUS}, Absent(),
-         Absent(), {6, GUARD_MODE_CONTINUOUS}, GUARD_CMD_STOP},
-        {"other mode while pausing", GUARD_STATE_INTERVAL, {5, GUARD_MODE_CONTINUOUS}, Present(),
-         Absent(), {5, GUARD_MODE_FIRST_EVENT}, GUARD_CMD_STOP},
-        {"off while pausing", GUARD_STATE_INTERVAL, {5, GUARD_MODE_CONTINUOUS}, Absent(),
-         Absent(), {5, GUARD_MODE_OFF}, GUARD_CMD_STOP},
-        {"off while running in off mode", GUARD_STATE_RUNNING, {5, GUARD_MODE_OFF}, Absent(),
-         Absent(), {5, GUARD_MODE_OFF}, GUARD_CMD_STOP},
-        {"new entry during hold-off: judged, not idle", GUARD_STATE_HOLDOFF,
-         {5, GUARD_MODE_CONTINUOUS}, Present(), Present(), {6, GUARD_MODE_ANY_EVENT},
-         GUARD_CMD_NONE},
+    } const cases[] = {
+        {IDLE, {0, OFF}, on, on, {5, OFF}, NONE},
+        {IDLE, {0, OFF}, off, off, {5, CONT}, START},
+        {IDLE, {0, OFF}, on, off, {5, FIRST}, START},
+        {IDLE, {0, OFF}, off, on, {5, FIRST}, NONE},
+        {IDLE, {0, OFF}, expired, off, {5, FIRST}, NONE},  // active but expired
+        {IDLE, {0, OFF}, ahead, off, {5, FIRST}, NONE},
+        {IDLE, {0, OFF}, off, on, {5, SECOND}, START},
+        {IDLE, {0, OFF}, on, expired, {5, SECOND}, NONE},
+        {IDLE, {0, OFF}, off, on, {5, ANY}, START},
+        {IDLE, {0, OFF}, on, off, {5, ANY}, START},
+        {IDLE, {0, OFF}, expired, expired, {5, ANY}, NONE},
+        {IDLE, {0, OFF}, on, on, {5, 9}, NONE},  // unknown mode
+        {RUNNING, {5, CONT}, off, off, {5, CONT}, NONE},
+        {RUNNING, {5, CONT}, off, off, {6, CONT}, STOP},  // other patrol
+        {INTERVAL, {5, CONT}, on, off, {5, FIRST}, STOP},  // other mode
+        {INTERVAL, {5, CONT}, off, off, {5, OFF}, STOP},
+        {RUNNING, {5, OFF}, off, off, {5, OFF}, STOP},
+        {HOLDOFF, {5, CONT}, on, on, {6, ANY}, NONE},  // judged only once idle
     };
     PatrolExecutor executor;
     GuardExecutor guard(1);
     Peer::PrepareWithoutThread(guard, &executor, 1, 1, 10);
-    for (const Case& c : cases) {
+    for (size_t i = 0; i < sizeof cases / sizeof cases[0]; ++i) {
+        const Case& c = cases[i];
         Peer::SetState(guard, c.state);
         Peer::SetCurrent(guard, c.current);
         Peer::SetCommand(guard, GUARD_CMD_NONE);
         guard.AnalyzeSchedule(c.first, c.second, c.info);
-        EXPECT_EQ(Peer::Command(guard), c.expected) << c.what;
-        EXPECT_EQ(Peer::Pending(guard).patrolId, c.info.patrolId) << c.what;
-        EXPECT_EQ(Peer::Pending(guard).mode, c.info.mode) << c.what;
+        EXPECT_EQ(Peer::Command(guard), c.expected) << "case " << i;
+        EXPECT_EQ(Peer::Pending(guard).patrolId, c.info.patrolId) << "case " << i;
+        EXPECT_EQ(Peer::Pending(guard).mode, c.info.mode) << "case " << i;
     }
 
     // An untaken command is never overwritten, though pending is.
-    Peer::SetState(guard, GUARD_STATE_RUNNING);
-    Peer::SetCurrent(guard, {5, GUARD_MODE_CONTINUOUS});
-    Peer::SetCommand(guard, GUARD_CMD_START);
-    guard.AnalyzeSchedule(Absent(), Absent(), {7, GUARD_MODE_OFF});
-    EXPECT_EQ(Peer::Command(guard), GUARD_CMD_START);
+    Peer::SetState(guard, RUNNING);
+    Peer::SetCurrent(guard, {5, CONT});
+    Peer::SetCommand(guard, START);
+    guard.AnalyzeSchedule(off, off, {7, OFF});
+    EXPECT_EQ(Peer::Command(guard), START);
     EXPECT_EQ(Peer::Pending(guard).patrolId, 7);
     Peer::Unprepare(guard);
-}
 
-TEST_F(GuardExecutorTest, EventValiditySpanDoesNotOverflow) {
-    PatrolExecutor executor;
-    GuardExecutor guard(1);
     // 3000 s in microseconds does not fit 32 bits: the span saturates instead
     // of turning negative, so a 100 s old event is still present.
-    Peer::PrepareWithoutThread(guard, &executor, 1, 1, 3000);
-    guard.AnalyzeSchedule(Event(1, 100), Absent(), {5, GUARD_MODE_FIRST_EVENT});
-    EXPECT_EQ(Peer::Command(guard), GUARD_CMD_START);
-    Peer::Unprepare(guard);
-
-    GuardExecutor negative(2);  // a negative validity counts as 0
-    Peer::PrepareWithoutThread(negative, &executor, 1, 1, -5);
-    negative.AnalyzeSchedule(Event(1, 2), Absent(), {5, GUARD_MODE_FIRST_EVENT});
-    EXPECT_EQ(Peer::Command(negative), GUARD_CMD_NONE);
-    Peer::Unprepare(negative);
+    GuardExecutor longSpan(2);
+    Peer::PrepareWithoutThread(longSpan, &executor, 1, 1, 3000);
+    longSpan.AnalyzeSchedule(Event(1, 100), off, {5, FIRST});
+    EXPECT_EQ(Peer::Command(longSpan), START);
+    Peer::Unprepare(longSpan);
 }
 
 TEST_F(GuardExecutorTest, StartTakesTheNewestPendingEntry) {
@@ -329,16 +308,6 @@ TEST_F(GuardExecutorTest, TerminateDuringARunLeavesTheTourToFinish) {
     std::this_thread::sleep_for(1500ms);
     EXPECT_EQ(fake::Moves(), MovesTo({1, 2, 3, 1}));
     EXPECT_EQ(Loads(260), 1);
-}
-
-TEST_F(GuardExecutorTest, DestructorTerminatesAForgottenGuard) {
-    PatrolExecutor executor;
-    {
-        GuardExecutor guard(1);
-        ASSERT_EQ(guard.Init(&executor, 1, 1, 10), 0);
-        EXPECT_EQ(guard.Init(&executor, 1, 1, 10), -1);  // one thread per guard
-    }
-    SUCCEED();
 }
 
 }  // namespace

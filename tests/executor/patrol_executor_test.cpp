@@ -11,13 +11,6 @@
 #include "executor/patrolExecutor.h"
 #include "executor_test_util.h"
 
-// Reaches single moves, which the loop never makes with out-of-range indexes.
-struct PatrolExecutorPeer {
-    static int ExecPatrol(PatrolExecutor& e, Patrol& p, int& index, bool& done) {
-        return e.ExecPatrol(p, index, done);
-    }
-};
-
 namespace {
 
 using namespace extest;
@@ -116,7 +109,10 @@ TEST_F(PatrolExecutorTest, DirectDisplacesGuardRunWhichThenRestartsFromItsFirstP
     StorePatrol({21, 1, 0, {7, 8}});
     PatrolExecutor executor;
     executor.Execute(20, PATROL_EXEC_GUARD);
-    ASSERT_TRUE(WaitForMoves(2, 3000ms));  // guard run is at its second preset
+    ASSERT_TRUE(WaitForMoves(1));
+    executor.Execute(20, PATROL_EXEC_GUARD);  // the same request again: run undisturbed
+    ASSERT_TRUE(WaitForMoves(2, 3000ms));
+    EXPECT_EQ(Loads(20), 1);
     executor.Execute(21, PATROL_EXEC_DIRECT);
     ASSERT_TRUE(WaitForMoves(6, 3000ms));
     EXPECT_EQ(fake::Moves(), MovesTo({1, 2, 7, 8, 7, 1}));
@@ -141,18 +137,6 @@ TEST_F(PatrolExecutorTest, GuardRequestWaitsBehindDirectRunEvenWhenItsRemovalIsO
     ASSERT_TRUE(WaitForStatus(executor, PATROL_STATUS_IDLE));
     EXPECT_EQ(Loads(30), 1);
     EXPECT_EQ(Loads(31), 1);
-}
-
-TEST_F(PatrolExecutorTest, SameRequestAgainLeavesTheRunUndisturbed) {
-    StorePatrol({40, 1, 1, {1, 2, 3}});
-    PatrolExecutor executor;
-    executor.Execute(40, PATROL_EXEC_GUARD);
-    ASSERT_TRUE(WaitForMoves(2, 3000ms));
-    executor.Execute(40, PATROL_EXEC_GUARD);
-    ASSERT_TRUE(WaitForMoves(4, 4000ms));
-    EXPECT_EQ(fake::Moves(), MovesTo({1, 2, 3, 1}));
-    EXPECT_EQ(Loads(40), 1);
-    ASSERT_TRUE(WaitForStatus(executor, PATROL_STATUS_IDLE));
 }
 
 TEST_F(PatrolExecutorTest, RemovalOfTheRunningKindAndOfTheOtherKind) {
@@ -214,9 +198,15 @@ TEST_F(PatrolExecutorTest, ZeroAndNegativeIdsAreNothingToRun) {
     ASSERT_TRUE(WaitForStatus(executor, PATROL_STATUS_IDLE));
 }
 
-TEST_F(PatrolExecutorTest, RequestsThatDoNotLoad) {
+TEST_F(PatrolExecutorTest, RequestsThatDoNotLoadOrHaveNoPresets) {
     StorePatrol({70, 1, 0, {4, 5}});
+    StorePatrol({71, 1, 0, {}});
     PatrolExecutor executor;
+
+    executor.Execute(71, PATROL_EXEC_DIRECT);
+    ASSERT_TRUE(fake::WaitFor(
+        [] { return Logged(kFile, "ExecPatrol", "No preset to execute."); }, 2000ms));
+    EXPECT_EQ(executor.GetStatus(), PATROL_STATUS_IDLE);
 
     // A guard request that does not load: logged, idle, slot emptied.
     executor.Execute(42, PATROL_EXEC_GUARD);
@@ -235,6 +225,7 @@ TEST_F(PatrolExecutorTest, RequestsThatDoNotLoad) {
     EXPECT_TRUE(Logged(kFile, "ChangeExcutePatrol", "Load patrol 43 failure."));
     EXPECT_EQ(fake::Moves(), MovesTo({4, 5, 4}));
     ASSERT_TRUE(WaitForStatus(executor, PATROL_STATUS_IDLE));
+    EXPECT_EQ(Loads(71), 1);
     EXPECT_EQ(fake::ResultsOutstanding(), 0);
 }
 
@@ -252,18 +243,6 @@ TEST_F(PatrolExecutorTest, FailedDirectLoadRestartsTheInterruptedGuardRun) {
     ASSERT_TRUE(WaitForMoves(6, 5000ms));
     EXPECT_EQ(fake::Moves(), MovesTo({1, 2, 1, 2, 3, 1}));
     ASSERT_TRUE(WaitForStatus(executor, PATROL_STATUS_IDLE));
-}
-
-TEST_F(PatrolExecutorTest, PatrolWithoutPresetsEndsIdle) {
-    StorePatrol({90, 1, 0, {}});
-    PatrolExecutor executor;
-    executor.Execute(90, PATROL_EXEC_DIRECT);
-    ASSERT_TRUE(fake::WaitFor(
-        [] { return Logged(kFile, "ExecPatrol", "No preset to execute."); }, 2000ms));
-    EXPECT_EQ(executor.GetStatus(), PATROL_STATUS_IDLE);
-    std::this_thread::sleep_for(2 * kPass);
-    EXPECT_TRUE(fake::Moves().empty());
-    EXPECT_EQ(Loads(90), 1);
 }
 
 TEST_F(PatrolExecutorTest, CameraRefusingTheSecondPresetEndsTheRun) {
@@ -290,48 +269,6 @@ TEST_F(PatrolExecutorTest, DestructionDuringARunMakesNoFurtherMove) {
     ASSERT_TRUE(fake::WaitFor([&] { return entered.load() == 2; }, 2000ms));
     executor.reset();  // posted while the second move is under way
     EXPECT_EQ(fake::Moves(), MovesTo({1, 2}));
-    EXPECT_EQ(fake::ApisOutstanding(), 0);
-}
-
-TEST_F(PatrolExecutorTest, SingleMoves) {
-    StorePatrol({120, 4, 0, {5, 2}});
-    PatrolExecutor executor;  // idle; its worker does not touch the run below
-    Patrol patrol;
-    ASSERT_EQ(patrol.Load(120), 0);
-    fake::Reset();  // forget the load; the camera must be scripted again
-    StorePatrol({120, 4, 0, {5, 2}});
-
-    int index = 2;
-    bool done = false;
-    EXPECT_EQ(PatrolExecutorPeer::ExecPatrol(executor, patrol, index, done), -2);
-    EXPECT_TRUE(Logged(kFile, "ExecPatrol", "Parameter error."));
-    index = -1;
-    EXPECT_EQ(PatrolExecutorPeer::ExecPatrol(executor, patrol, index, done), -1);
-    EXPECT_TRUE(Logged(kFile, "ExecPatrol", "Get preset information failure."));
-    EXPECT_TRUE(fake::CameraCalls().empty());
-
-    // The closing move of a tour: the camera is still sent there, -1, index kept.
-    index = 0;
-    done = true;
-    EXPECT_EQ(PatrolExecutorPeer::ExecPatrol(executor, patrol, index, done), -1);
-    EXPECT_EQ(index, 0);
-    EXPECT_EQ(fake::Moves(), MovesTo({5}));
-
-    // The last preset wraps the index and marks the tour done.
-    index = 1;
-    done = false;
-    EXPECT_EQ(PatrolExecutorPeer::ExecPatrol(executor, patrol, index, done), 0);
-    EXPECT_EQ(index, 0);
-    EXPECT_TRUE(done);
-
-    fake::CameraHost(CameraHostName(4)).apiNull = true;
-    EXPECT_EQ(PatrolExecutorPeer::ExecPatrol(executor, patrol, index, done), -1);
-    EXPECT_TRUE(Logged(kFile, "ExecPatrol", "Get camera API failed."));
-
-    fake::Reset();  // no camera record at all
-    EXPECT_EQ(PatrolExecutorPeer::ExecPatrol(executor, patrol, index, done), -1);
-    EXPECT_TRUE(Logged(kFile, "ExecPatrol", "Get camera info. [4] failed."));
-    EXPECT_EQ(fake::CameraCallNames(), std::vector<std::string>{"Camera::Load 4"});
     EXPECT_EQ(fake::ApisOutstanding(), 0);
 }
 
