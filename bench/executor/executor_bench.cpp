@@ -7,8 +7,9 @@
 //    most one 250 ms pass beyond them;
 //  - Guards/256: 256 guards bound to 256 executors, idle, then in continuous
 //    mode on a patrol whose camera refuses connections.
-// The patrol store is a throwaway PostgreSQL cluster started here
-// (scripts/pg_cluster.sh); the camera is the simulator of the tests.
+// The patrol store is the cluster of scripts/bench.sh, or a throwaway one
+// started here (scripts/pg_cluster.sh); the camera is the simulator of the
+// tests. Run: scripts/bench.sh executor_bench
 #include <benchmark/benchmark.h>
 #include <netinet/in.h>
 #include <pthread.h>
@@ -102,6 +103,7 @@ public:
         return p.Save() == 0 ? p.GetId() : -1;
     }
     bool AddCamera(int id, int port) {
+        OvDBExecute("DELETE FROM camera WHERE id = " + itos(id) + ";");
         return OvDBExecute("INSERT INTO camera (id, host, port, username, password, vendor) "
                            "VALUES (" + itos(id) + ", '127.0.0.1', " + itos(port) +
                            ", 'admin', 'secret', 'onvif');") == 0;
@@ -109,6 +111,12 @@ public:
 
 private:
     World() {
+        const char* given = getenv("PTZ_PG_DIR");
+        if (given != nullptr && getenv("PGHOST") != nullptr) {  // scripts/bench.sh made one
+            sim_ = std::make_unique<CamSim>();
+            ok_ = true;
+            return;
+        }
         dir_ = "/tmp/ptzbench." + std::to_string(getpid());
         const std::string start =
             std::string(PTZ_SOURCE_DIR) + "/scripts/pg_cluster.sh start " + dir_ + " >/dev/null";
@@ -124,6 +132,7 @@ private:
     }
     ~World() {
         sim_.reset();
+        if (dir_.empty()) return;
         const std::string stop =
             std::string(PTZ_SOURCE_DIR) + "/scripts/pg_cluster.sh stop " + dir_ + " >/dev/null";
         if (std::system(stop.c_str()) != 0) fprintf(stderr, "executor_bench: stop failed\n");
@@ -175,7 +184,7 @@ void BM_ExecuteToFirstMove(benchmark::State& state) {
         state.SkipWithError("no PostgreSQL cluster or simulator");
         return;
     }
-    const int camId = 1;
+    const int camId = 9001;
     world.AddCamera(camId, world.Sim().Port());
     const int id = world.StorePatrol(camId, 60, {5, 2, 9});
 
@@ -252,7 +261,7 @@ void BM_Guards(benchmark::State& state) {
         return;
     }
     const int n = static_cast<int>(state.range(0));
-    const int camId = 2;
+    const int camId = 9002;
     onvif::SetCallTimeoutMs(5000);
     world.AddCamera(camId, RefusingPort());
     const int id = world.StorePatrol(camId, 0, {1, 2});
