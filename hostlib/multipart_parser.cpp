@@ -263,7 +263,8 @@ MultipartParser::Result MultipartParser::BodyToDelimiter(MultipartPart& part, bo
 
     auto check = [&](size_t at, size_t delimLen) {
         // `at` starts a line; delimLen bytes of delimiter follow. 1 valid, 0 not, -1 incomplete.
-        // At the end of the stream the line may end without a line break.
+        // At the end of the stream a closing delimiter may lack its line break;
+        // an opening one may not (it could be a cut-off content line).
         size_t k = at + delimLen;
         bool close = false;
         if (k < size && content_[k] == '-') {
@@ -274,7 +275,7 @@ MultipartParser::Result MultipartParser::BodyToDelimiter(MultipartPart& part, bo
         }
         while (k < size && (content_[k] == ' ' || content_[k] == '\t')) ++k;
         if (k < size && content_[k] == '\r') ++k;
-        if (k >= size && !ended_) return -1;
+        if (k >= size && (!ended_ || !close)) return ended_ ? 0 : -1;
         if (k < size && content_[k] != '\n') return 0;
         if (at < best) {
             best = at;
@@ -316,13 +317,13 @@ MultipartParser::Result MultipartParser::BodyToDelimiter(MultipartPart& part, bo
                     pending = std::min(pending, start);
                 continue;
             }
-            if (nl == std::string::npos && !ended_) {
-                pending = std::min(pending, start);
+            if (nl == std::string::npos) {
+                if (!ended_) pending = std::min(pending, start);
                 break;
             }
             SetBoundary(name);
             best = start;
-            bestEnd = nl == std::string::npos ? size : nl;
+            bestEnd = nl;
             break;
         }
     }
