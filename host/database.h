@@ -39,8 +39,8 @@ int KELODBFetchRow(DBResult_tag* result, unsigned int* row);
 
 // Text of a field, numbers in decimal. The column is named as the statement
 // spells it ("camId" finds the server's "camid"). Null when the result has no
-// such column or row, or when the field is SQL NULL. The text lives as long as
-// the result.
+// such column or row; callers take a null text as 0 or as an empty name. The
+// text lives as long as the result.
 const char* KELODBFetchField(DBResult_tag* result, unsigned int row, const char* column);
 
 // Releases a result; a null handle is accepted and ignored.

@@ -1,17 +1,237 @@
-// PostgreSQL database layer (placeholder until the libpq implementation lands).
+// PostgreSQL database layer on libpq: a pool of connections, statements run
+// with PQexec, results kept as PGresult until the caller frees them.
+#include <libpq-fe.h>
+#include <poll.h>
+
+#include <condition_variable>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
 #include "host/database.h"
+#include "hostlib/database_config.h"
 
 const char* gszTablePatrol = "patrol";
 const char* gszTablePatrolPresetData = "patrol_preset";
 
-int OvDBExecute(const std::string&, DBResult_tag**) { return -1; }
-int OvDBExecute(const std::string&) { return -1; }
-std::string OvDBEscapeString(const std::string& text) { return text; }
+struct DBResult_tag {
+    PGresult* res;
+    int nextRow;
+};
+
+namespace {
+
+struct ConnCloser {
+    void operator()(PGconn* c) const { PQfinish(c); }
+};
+using ConnPtr = std::unique_ptr<PGconn, ConnCloser>;
+
+class Pool {
+public:
+    // Borrows a working connection, opening one if needed. Null when the
+    // server cannot be reached.
+    ConnPtr Acquire() {
+        std::unique_lock<std::mutex> lock(mu_);
+        cv_.wait(lock, [&] { return !idle_.empty() || open_ < size_; });
+        ConnPtr conn;
+        std::string conninfo = conninfo_;
+        if (!idle_.empty()) {
+            conn = std::move(idle_.back());
+            idle_.pop_back();
+        } else {
+            ++open_;  // reserve the slot while connecting outside the lock
+        }
+        const unsigned generation = generation_;
+        lock.unlock();
+
+        if (conn && !Healthy(conn.get())) PQreset(conn.get());
+        if (!conn) conn = Connect(conninfo);
+        if (conn && PQstatus(conn.get()) != CONNECTION_OK) conn.reset();
+        if (!conn) {
+            Release(nullptr, generation);
+            return nullptr;
+        }
+        return conn;
+    }
+
+    // Returns a connection (null: the slot is freed).
+    void Release(ConnPtr conn, unsigned generation) {
+        std::lock_guard<std::mutex> lock(mu_);
+        if (conn && generation == generation_ && PQstatus(conn.get()) == CONNECTION_OK &&
+            PQtransactionStatus(conn.get()) == PQTRANS_IDLE) {
+            idle_.push_back(std::move(conn));
+        } else {
+            --open_;
+            conn.reset();
+        }
+        cv_.notify_one();
+    }
+
+    void SetConnInfo(const std::string& conninfo) {
+        std::lock_guard<std::mutex> lock(mu_);
+        conninfo_ = conninfo;
+        ++generation_;
+        open_ -= static_cast<int>(idle_.size());
+        idle_.clear();
+        cv_.notify_all();
+    }
+
+    void SetSize(int size) {
+        std::lock_guard<std::mutex> lock(mu_);
+        size_ = size < 1 ? 1 : size;
+        cv_.notify_all();
+    }
+
+    void CloseIdle() {
+        std::lock_guard<std::mutex> lock(mu_);
+        open_ -= static_cast<int>(idle_.size());
+        idle_.clear();
+        cv_.notify_all();
+    }
+
+    unsigned Generation() {
+        std::lock_guard<std::mutex> lock(mu_);
+        return generation_;
+    }
+
+private:
+    static ConnPtr Connect(const std::string& conninfo) {
+        // Later keywords win: the host's settings may override the timeout.
+        const char* keys[] = {"connect_timeout", "dbname", "client_encoding", nullptr};
+        const char* values[] = {"10", conninfo.c_str(), "UTF8", nullptr};
+        ConnPtr conn(PQconnectdbParams(keys, values, 1));
+        // Server notices are not the host's business; libpq would print them to stderr.
+        if (conn) PQsetNoticeProcessor(conn.get(), [](void*, const char*) {}, nullptr);
+        return conn;
+    }
+
+    // An idle connection has nothing to read unless its server sent a
+    // termination notice or closed it (restart, shutdown, idle kill): then it
+    // is reset before a statement is sent on it.
+    static bool Healthy(PGconn* conn) {
+        if (PQstatus(conn) != CONNECTION_OK) return false;
+        struct pollfd pfd = {PQsocket(conn), POLLIN, 0};
+        if (pfd.fd < 0) return false;
+        return poll(&pfd, 1, 0) == 0;
+    }
+
+    std::mutex mu_;
+    std::condition_variable cv_;
+    std::vector<ConnPtr> idle_;
+    int open_ = 0;
+    int size_ = 8;
+    unsigned generation_ = 0;
+    std::string conninfo_;
+};
+
+Pool& ThePool() {
+    static Pool* pool = new Pool;  // lives to process exit: statements may run during teardown
+    return *pool;
+}
+
+// Borrowed connection, returned to the pool on every way out.
+class Lease {
+public:
+    Lease() : generation_(ThePool().Generation()), conn_(ThePool().Acquire()) {}
+    ~Lease() {
+        if (conn_) ThePool().Release(std::move(conn_), generation_);
+    }
+    Lease(const Lease&) = delete;
+    Lease& operator=(const Lease&) = delete;
+    PGconn* get() const { return conn_.get(); }
+
+private:
+    unsigned generation_;
+    ConnPtr conn_;
+};
+
+// Runs one statement; the result on success, null on failure.
+PGresult* Run(const std::string& sql) {
+    Lease lease;
+    if (!lease.get()) return nullptr;
+    PGresult* res = PQexec(lease.get(), sql.c_str());
+    const ExecStatusType st = PQresultStatus(res);
+    if (st != PGRES_TUPLES_OK && st != PGRES_COMMAND_OK) {
+        PQclear(res);
+        return nullptr;
+    }
+    return res;
+}
+
+}  // namespace
+
+void HostDBSetConnInfo(const std::string& conninfo) { ThePool().SetConnInfo(conninfo); }
+void HostDBSetPoolSize(int size) { ThePool().SetSize(size); }
+void HostDBCloseIdle() { ThePool().CloseIdle(); }
+
+int OvDBExecute(const std::string& sql, DBResult_tag** result) {
+    if (result == nullptr) return -1;
+    PGresult* res = Run(sql);
+    if (!res) return -1;
+    *result = new (std::nothrow) DBResult_tag{res, 0};
+    if (!*result) {
+        PQclear(res);
+        return -1;
+    }
+    return 0;
+}
+
+int OvDBExecute(const std::string& sql) {
+    PGresult* res = Run(sql);
+    if (!res) return -1;
+    PQclear(res);
+    return 0;
+}
+
+std::string OvDBEscapeString(const std::string& text) {
+    std::string out(text.size() * 2 + 1, '\0');
+    size_t n;
+    {
+        Lease lease;
+        if (lease.get()) {
+            int error = 0;
+            n = PQescapeStringConn(lease.get(), &out[0], text.data(), text.size(), &error);
+        } else {
+            // No server to ask: standard-conforming strings, only quotes doubled.
+            // A statement built from it cannot run anyway until the server is back.
+            n = 0;
+            for (char c : text) {
+                if (c == '\0') break;
+                if (c == '\'') out[n++] = '\'';
+                out[n++] = c;
+            }
+        }
+    }
+    out.resize(n);
+    return out;
+}
+
 std::string itos(long long value) { return std::to_string(value); }
 
 extern "C" {
-int KELODBNumRows(DBResult_tag*) { return 0; }
-int KELODBFetchRow(DBResult_tag*, unsigned int*) { return -1; }
-const char* KELODBFetchField(DBResult_tag*, unsigned int, const char*) { return nullptr; }
-void KELODBFreeResult(DBResult_tag*) {}
+
+int KELODBNumRows(DBResult_tag* result) { return result ? PQntuples(result->res) : 0; }
+
+int KELODBFetchRow(DBResult_tag* result, unsigned int* row) {
+    if (!result || !row || result->nextRow >= PQntuples(result->res)) return -1;
+    *row = static_cast<unsigned int>(result->nextRow++);
+    return 0;
 }
+
+const char* KELODBFetchField(DBResult_tag* result, unsigned int row, const char* column) {
+    if (!result || !column) return nullptr;
+    if (row >= static_cast<unsigned int>(PQntuples(result->res))) return nullptr;
+    // PQfnumber folds an unquoted name to lower case, as the server did.
+    const int col = PQfnumber(result->res, column);
+    if (col < 0) return nullptr;
+    return PQgetvalue(result->res, static_cast<int>(row), col);
+}
+
+void KELODBFreeResult(DBResult_tag* result) {
+    if (!result) return;
+    PQclear(result->res);
+    delete result;
+}
+
+}  // extern "C"

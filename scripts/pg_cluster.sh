@@ -3,6 +3,8 @@
 #
 #   pg_cluster.sh start DIR     initdb into DIR, start the server, load the schema
 #   pg_cluster.sh restart DIR   restart a running cluster (fast shutdown)
+#   pg_cluster.sh down DIR      stop the server, keep the cluster
+#   pg_cluster.sh up DIR        start it again
 #   pg_cluster.sh stop DIR      stop the server and remove DIR
 #
 # The server listens only on a unix socket in DIR (no TCP), runs as an
@@ -10,8 +12,8 @@
 # of the database user "ptz". Clients use PGHOST=DIR PGUSER=ptz PGDATABASE=ptztest.
 set -euo pipefail
 
-cmd=${1:?usage: pg_cluster.sh start|restart|stop DIR}
-dir=${2:?usage: pg_cluster.sh start|restart|stop DIR}
+cmd=${1:?usage: pg_cluster.sh start|restart|down|up|stop DIR}
+dir=${2:?usage: pg_cluster.sh start|restart|down|up|stop DIR}
 here=$(cd "$(dirname "$0")" && pwd)
 schema="$here/../hostlib/schema.sql"
 
@@ -26,6 +28,11 @@ as_owner() {
   else
     "$@"
   fi
+}
+
+server_start() {
+  as_owner "$bindir/pg_ctl" -D "$dir/data" -l "$dir/server.log" -w -t 60 \
+    -o "-c listen_addresses='' -c unix_socket_directories='$dir' -c fsync=off -c max_connections=300" start >/dev/null
 }
 
 case "$cmd" in
@@ -44,15 +51,19 @@ start)
   as_owner "$bindir/initdb" -D "$dir/data" -U ptz -A trust -E UTF8 --locale=C.UTF-8 >"$dir/initdb.log" 2>&1 ||
     { cat "$dir/initdb.log" >&2; exit 1; }
   chmod 755 "$dir"
-  as_owner "$bindir/pg_ctl" -D "$dir/data" -l "$dir/server.log" -w -t 60 \
-    -o "-c listen_addresses='' -c unix_socket_directories='$dir' -c fsync=off -c max_connections=300" start >/dev/null ||
-    { cat "$dir/server.log" >&2; exit 1; }
+  server_start || { cat "$dir/server.log" >&2; exit 1; }
   as_owner "$bindir/createdb" -h "$dir" -U ptz ptztest
   psql -X -q -v ON_ERROR_STOP=1 -h "$dir" -U ptz -d ptztest -f "$schema" >/dev/null
   echo "pg_cluster: started in $dir"
   ;;
 restart)
   as_owner "$bindir/pg_ctl" -D "$dir/data" -l "$dir/server.log" -w -t 60 -m fast restart >/dev/null
+  ;;
+down)
+  as_owner "$bindir/pg_ctl" -D "$dir/data" -w -t 60 -m fast stop >/dev/null
+  ;;
+up)
+  server_start
   ;;
 stop)
   if [ -d "$dir/data" ]; then
@@ -62,7 +73,7 @@ stop)
   echo "pg_cluster: stopped $dir"
   ;;
 *)
-  echo "usage: pg_cluster.sh start|restart|stop DIR" >&2
+  echo "usage: pg_cluster.sh start|restart|down|up|stop DIR" >&2
   exit 2
   ;;
 esac

@@ -1,0 +1,33 @@
+// Settings of the PostgreSQL database layer (host/database.h).
+//
+// Connections: a small pool shared by all threads. A statement borrows one
+// connection for the time of its execution and returns it; results are kept
+// apart from the connection, so a result never ties up a connection. Up to
+// the pool size, connections are opened on demand; beyond it a statement waits
+// for one to come back.
+//
+// Connection settings come from the standard libpq environment (PGHOST,
+// PGPORT, PGDATABASE, PGUSER, PGPASSWORD, PGSSLMODE, ...) unless the host sets
+// a conninfo string first. Every connection uses client_encoding UTF8 and,
+// unless the settings say otherwise, a connect timeout of 10 seconds.
+//
+// A broken connection (the server restarted or dropped it) is found before a
+// statement is sent and reset then, so the next statement works once the
+// server is back. A statement whose connection breaks while it runs fails and
+// is not sent again: it may have been executed.
+#ifndef HOSTLIB_DATABASE_CONFIG_H
+#define HOSTLIB_DATABASE_CONFIG_H
+
+#include <string>
+
+// Sets the libpq conninfo string ("host=/run/pg dbname=nvr" or a URI) for
+// connections opened from now on, and closes the idle ones. Empty: environment only.
+void HostDBSetConnInfo(const std::string& conninfo);
+
+// Sets the most connections open at once (at least 1; default 8).
+void HostDBSetPoolSize(int size);
+
+// Closes every idle connection (connections in use close when returned).
+void HostDBCloseIdle();
+
+#endif  // HOSTLIB_DATABASE_CONFIG_H
