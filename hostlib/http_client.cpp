@@ -150,9 +150,10 @@ int MultipartFetch::FetchContent(unsigned char* buffer, unsigned int length) {
         memcpy(buffer, m.part.content.data() + m.partRead, length);
     }
     m.partRead += length;
-    if (m.partRead == m.part.content.size()) {
+    if (m.partRead == m.part.content.size()) {  // all handed out: let it go
         m.part.content.clear();
         m.part.content.shrink_to_fit();
+        m.partRead = 0;
     }
     return 0;
 }
