@@ -162,9 +162,12 @@ int MultipartParser::DelimiterKind(const std::string& line) const {
 
 // Before the first part and between parts: skips blank lines and junk up to a
 // delimiter line, or up to a header line (a part without a delimiter before it).
+// Lines longer than kMaxLine are junk whatever they hold, so the outcome does
+// not depend on how the input was split.
 MultipartParser::Result MultipartParser::Seek(bool& progressed) {
     std::string line;
     for (;;) {
+        size_t before = pos_;
         if (!TakeLine(line)) {
             size_t pending = in_.size() - pos_;
             if (pending > kMaxLine) {  // an over-long line cannot be a delimiter: drop it
@@ -176,10 +179,11 @@ MultipartParser::Result MultipartParser::Seek(bool& progressed) {
             }
             return Result::kNeedMore;
         }
+        size_t raw = pos_ - before;  // with its line break
         progressed = true;
-        if (skippingLine_) {
+        if (skippingLine_ || raw > kMaxLine + 1) {
             skippingLine_ = false;
-            skipped_ += line.size();
+            skipped_ += raw;
         } else if (int kind = DelimiterKind(line)) {
             skipped_ = 0;
             if (kind == 2) {
@@ -188,6 +192,8 @@ MultipartParser::Result MultipartParser::Seek(bool& progressed) {
                 pos_ = 0;
                 return Result::kEnd;
             }
+            headers_.clear();
+            headerBytes_ = 0;
             state_ = State::kHeaders;
             return Result::kNeedMore;
         } else if (boundary_.empty() && line.size() > 2 && line.compare(0, 2, "--") == 0 &&
@@ -195,32 +201,39 @@ MultipartParser::Result MultipartParser::Seek(bool& progressed) {
             // The parameter named no boundary: the first delimiter line does.
             SetBoundary(TrimRight(line).substr(2));
             skipped_ = 0;
+            headers_.clear();
+            headerBytes_ = 0;
             state_ = State::kHeaders;
             return Result::kNeedMore;
         } else if (LooksLikeHeader(line)) {
             skipped_ = 0;
             headers_ = TrimRight(line);
+            headerBytes_ = raw;
             state_ = State::kHeaders;
             return Result::kNeedMore;
         } else {
-            skipped_ += line.size() + 1;
+            skipped_ += raw;
         }
         if (skipped_ > kMaxSkipBytes) return Fail();
     }
 }
 
+// Header lines up to the blank line. The block is bounded in received bytes,
+// so a split input fails exactly where a whole one does.
 MultipartParser::Result MultipartParser::Headers(bool& progressed) {
     std::string line;
     for (;;) {
+        size_t before = pos_;
         if (!TakeLine(line)) {
-            if (headers_.size() + (in_.size() - pos_) > kMaxHeaderBytes) return Fail();
+            if (headerBytes_ + (in_.size() - pos_) > kMaxHeaderBytes) return Fail();
             return Result::kNeedMore;
         }
         progressed = true;
+        headerBytes_ += pos_ - before;
+        if (headerBytes_ > kMaxHeaderBytes) return Fail();
         if (line.empty()) break;
         if (!headers_.empty()) headers_ += "\r\n";
         headers_ += TrimRight(line);
-        if (headers_.size() > kMaxHeaderBytes) return Fail();
     }
     bool tooBig = false;
     lengthKnown_ = PartLength(headers_, maxPart_, length_, tooBig);
@@ -340,6 +353,7 @@ MultipartParser::Result MultipartParser::BodyToDelimiter(MultipartPart& part, bo
         Result r = Emit(part);
         // The delimiter line is consumed: the next part's headers follow.
         state_ = bestClose ? State::kEpilogue : State::kHeaders;
+        headerBytes_ = 0;
         if (bestClose) in_.clear();
         return r;
     }

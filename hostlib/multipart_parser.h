@@ -72,6 +72,7 @@ private:
     bool skippingLine_ = false;  // inside an over-long junk line
 
     std::string headers_;
+    size_t headerBytes_ = 0;  // received bytes of the current header block
     bool lengthKnown_ = false;
     size_t length_ = 0;
     std::string content_;
