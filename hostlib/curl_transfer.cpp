@@ -116,11 +116,11 @@ size_t CurlTransfer::OnBody(char* data, size_t size, size_t count, void* self) {
     size_t n = size * count;
     t->progress_ = true;
     t->headersDone_ = true;
-    size_t queued = t->Queued();
-    size_t queueRoom = queued >= kQueueBytes ? 0 : kQueueBytes - queued;
     // curl hands the same bytes again after a pause, so take all or nothing.
-    // An empty queue takes any piece: the bound is the queue plus one piece.
-    if (n > t->targetLeft_ && queued > 0 && n - t->targetLeft_ > queueRoom) {
+    // What the waiting read cannot take is queued only when the queue is
+    // empty: it holds at most one piece, and copying body bytes twice stays
+    // the exception.
+    if (n > t->targetLeft_ && t->Queued() > 0) {
         t->paused_ = true;
         return CURL_WRITEFUNC_PAUSE;
     }

@@ -1,8 +1,10 @@
 // One HTTP/1.1 GET (or empty POST) over libcurl's multi interface, read pull
 // style: the caller asks for bytes and the transfer runs only while it waits.
 // Received body bytes go straight into the caller's buffer when a read is
-// waiting, else into a bounded queue; when neither has room the write callback
-// pauses the transfer, so memory stays bounded whatever the server sends.
+// waiting; the rest of a piece that does not fit is queued, and when the
+// queue already holds a piece the write callback pauses the transfer. So the
+// queue never holds more than one piece of curl's receive buffer (64 KiB) and
+// memory stays bounded whatever the server sends.
 // All timing is our own deadlines in the poll loop (no CURLOPT_TIMEOUT, which
 // would cut long streams). One object per exchange, used by one thread.
 #ifndef HOSTLIB_CURL_TRANSFER_H
@@ -23,8 +25,6 @@ public:
         int timeoutSeconds = 30;
         bool post = false;  // an empty POST instead of a GET
     };
-
-    static constexpr size_t kQueueBytes = 262144;  // body bytes kept while nobody reads
 
     CurlTransfer();
     ~CurlTransfer();

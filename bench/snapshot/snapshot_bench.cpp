@@ -12,6 +12,7 @@
 #include <benchmark/benchmark.h>
 
 #include <cstdio>
+#include <cstring>
 #include <map>
 #include <memory>
 
@@ -104,9 +105,11 @@ void BM_CurlEasyPerform_2MiB(benchmark::State& state) {
     std::string url = Url("/snap.jpg");
     for (auto _ : state) {
         std::string body;
+        body.reserve(kImageBytes);
         CURL* curl = curl_easy_init();
         curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
         curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
+        curl_easy_setopt(curl, CURLOPT_BUFFERSIZE, 65536L);  // as SnapshotGet's transport
         curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, Append);
         curl_easy_setopt(curl, CURLOPT_WRITEDATA, &body);
         if (curl_easy_perform(curl) != CURLE_OK || body.size() != kImageBytes) state.SkipWithError("fetch failed");
@@ -157,11 +160,20 @@ public:
 
 // Prints ours / base for the benchmarks whose names start with those texts.
 void PrintRatio(const RatioReporter& r, const std::string& ours, const std::string& base, const char* goal) {
+    // With --benchmark_repetitions the median is used, else the single run.
     auto find = [&](const std::string& prefix) {
+        double plain = 0.0;
         for (const auto& t : r.times) {
-            if (t.first.rfind(prefix, 0) == 0) return t.second;
+            if (t.first.rfind(prefix, 0) != 0) continue;
+            if (t.first.size() > 7 && t.first.compare(t.first.size() - 7, 7, "_median") == 0) return t.second;
+            bool aggregate = false;
+            for (const char* suffix : {"_mean", "_stddev", "_cv"}) {
+                size_t n = strlen(suffix);
+                aggregate = aggregate || (t.first.size() > n && t.first.compare(t.first.size() - n, n, suffix) == 0);
+            }
+            if (!aggregate) plain = t.second;
         }
-        return 0.0;
+        return plain;
     };
     double a = find(ours), b = find(base);
     if (a <= 0 || b <= 0) return;
