@@ -1,0 +1,48 @@
+// Console reporter that, after the run, prints the ratio of each benchmark
+// "X/ours" to its baseline "X/baseline" measured in the same run.
+#ifndef BENCH_RATIO_REPORTER_H
+#define BENCH_RATIO_REPORTER_H
+
+#include <benchmark/benchmark.h>
+
+#include <cstdio>
+#include <map>
+#include <string>
+
+class RatioReporter : public benchmark::ConsoleReporter {
+public:
+    void ReportRuns(const std::vector<Run>& runs) override {
+        for (const Run& run : runs) {
+            if (run.run_type == Run::RT_Aggregate && run.aggregate_name != "median") continue;
+            times_[run.run_name.function_name] = run.GetAdjustedRealTime();
+        }
+        ConsoleReporter::ReportRuns(runs);
+    }
+    void Finalize() override {
+        ConsoleReporter::Finalize();
+        for (const auto& [name, ours] : times_) {
+            const std::string suffix = "/ours";
+            if (name.size() < suffix.size() || name.compare(name.size() - suffix.size(), suffix.size(), suffix) != 0)
+                continue;
+            const std::string base = name.substr(0, name.size() - suffix.size()) + "/baseline";
+            auto it = times_.find(base);
+            if (it == times_.end() || it->second <= 0) continue;
+            std::printf("ratio %-40s %.3f\n", name.substr(0, name.size() - suffix.size()).c_str(),
+                        ours / it->second);
+        }
+    }
+
+private:
+    std::map<std::string, double> times_;
+};
+
+#define RATIO_BENCHMARK_MAIN()                                    \
+    int main(int argc, char** argv) {                             \
+        benchmark::Initialize(&argc, argv);                       \
+        RatioReporter reporter;                                   \
+        benchmark::RunSpecifiedBenchmarks(&reporter);             \
+        benchmark::Shutdown();                                    \
+        return 0;                                                 \
+    }
+
+#endif  // BENCH_RATIO_REPORTER_H
