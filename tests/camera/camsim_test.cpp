@@ -1,9 +1,9 @@
 // The camera simulator itself: what the test-support class and other
 // developers' tests rely on (auth, moves with times, deliveries, faults).
+#include "support/camsim.h"
+
 #include <curl/curl.h>
 #include <gtest/gtest.h>
-
-#include "support/camsim.h"
 
 namespace {
 
@@ -42,8 +42,9 @@ Reply Fetch(int port, const std::string& path, const std::string& post = "",
 
 std::string Goto(const std::string& token, const std::string& profile = "Profile_1_main") {
     return "<s:Envelope xmlns:s=\"http://www.w3.org/2003/05/soap-envelope\"><s:Body>"
-           "<GotoPreset xmlns=\"http://www.onvif.org/ver20/ptz/wsdl\"><ProfileToken>" + profile +
-           "</ProfileToken><PresetToken>" + token + "</PresetToken></GotoPreset></s:Body></s:Envelope>";
+           "<GotoPreset xmlns=\"http://www.onvif.org/ver20/ptz/wsdl\"><ProfileToken>" +
+           profile + "</ProfileToken><PresetToken>" + token +
+           "</PresetToken></GotoPreset></s:Body></s:Envelope>";
 }
 
 TEST(CamSim, MovesAreLoggedWithTheSimulatorsClock) {
@@ -61,6 +62,36 @@ TEST(CamSim, MovesAreLoggedWithTheSimulatorsClock) {
     EXPECT_LE(moves[0].seconds, after);
     sim.ClearMoves();
     EXPECT_TRUE(sim.Moves().empty());
+}
+
+std::string Ptz(const std::string& inner) {
+    return "<s:Envelope xmlns:s=\"http://www.w3.org/2003/05/soap-envelope\"><s:Body>" + inner +
+           "</s:Body></s:Envelope>";
+}
+
+TEST(CamSim, SetAndRemovePresetsOverOnvif) {
+    CamSim sim;
+    const std::string ns = " xmlns=\"http://www.onvif.org/ver20/ptz/wsdl\"";
+    Reply set = Fetch(sim.Port(), "/onvif/ptz_service",
+                      Ptz("<SetPreset" + ns +
+                          "><ProfileToken>Profile_1_main</ProfileToken>"
+                          "<PresetName>Porch</PresetName></SetPreset>"));
+    ASSERT_EQ(set.status, 200) << set.body;
+    EXPECT_NE(set.body.find("<tptz:PresetToken>3</tptz:PresetToken>"), std::string::npos);
+    EXPECT_EQ(Fetch(sim.Port(), "/onvif/ptz_service",
+                    Ptz("<RemovePreset" + ns +
+                        "><ProfileToken>Profile_1_main</ProfileToken>"
+                        "<PresetToken>2</PresetToken></RemovePreset>"))
+                  .status,
+              200);
+    Reply list = Fetch(sim.Port(), "/onvif/ptz_service",
+                       Ptz("<GetPresets" + ns +
+                           "><ProfileToken>Profile_1_main</ProfileToken>"
+                           "</GetPresets>"));
+    EXPECT_NE(list.body.find("token=\"3\"><tt:Name>Porch</tt:Name>"), std::string::npos);
+    EXPECT_EQ(list.body.find("token=\"2\""), std::string::npos);
+    EXPECT_EQ(Fetch(sim.Port(), "/onvif/ptz_service", Goto("2")).status, 400);
+    EXPECT_EQ(Fetch(sim.Port(), "/onvif/ptz_service", Goto("3")).status, 200);
 }
 
 TEST(CamSim, RequiresCredentialsExceptOnControlEndpoints) {

@@ -67,8 +67,8 @@ CamSim::CamSim(Options options) {
         throw std::runtime_error("CamSim: pipe failed");
     }
     std::string binary = Binary();
-    std::vector<std::string> args = {binary, "--exit-on-stdin-eof", "--user", options.user,
-                                     "--password", options.password};
+    std::vector<std::string> args = {binary,       "--exit-on-stdin-eof", "--user",
+                                     options.user, "--password",          options.password};
     std::vector<char*> argv;
     for (std::string& a : args) argv.push_back(&a[0]);
     argv.push_back(nullptr);

@@ -10,7 +10,7 @@
 //   GET  /snapshot.jpg?profile=P   JPEG filled with the colour of the current preset
 //   GET  /mjpeg?profile=P&frames=N multipart/x-mixed-replace, 10 frames a second
 // and, without auth, the control endpoints for tests:
-//   GET  /control/ping | /control/presets | /control/moves | /control/now | /control/current
+//   GET  /control/ping | presets | moves | now | current | requests (count, control aside)
 //   POST /control/presets (lines "token<TAB>name"), /control/moves/clear,
 //        /control/fault ("name=value"; empty value clears), /control/faults/clear
 // Faults: delay_ms, status, refuse, snapshot_delivery (length|chunked|close),
@@ -21,7 +21,11 @@
 // clock_skew_s, no_get_services, no_get_capabilities, alt_paths
 // (/onvif/Media, /onvif/PTZ), internal_address ("host:port" reported in
 // service and snapshot addresses, as a camera behind NAT does).
-// GotoPreset carries only a token; every one received is logged on stderr.
+// GotoPreset carries only a token; every one received is logged on stderr
+// (unless the environment has CAMSIM_QUIET).
+#include "camsim.h"
+
+#include <httplib.h>
 #include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
@@ -29,14 +33,10 @@
 #include <string.h>
 #include <unistd.h>
 
-#include <httplib.h>
-
 #include <memory>
 #include <random>
 #include <sstream>
 #include <thread>
-
-#include "camsim.h"
 
 namespace camsim {
 
@@ -94,10 +94,9 @@ bool DigestOk(State& state, const httplib::Request& req) {
     if (p["username"] != user || p["nonce"].empty()) return false;
     std::string ha1 = Md5Hex(user + ":" + p["realm"] + ":" + password);
     std::string ha2 = Md5Hex(req.method + ":" + p["uri"]);
-    std::string expected =
-        p["qop"].empty() ? Md5Hex(ha1 + ":" + p["nonce"] + ":" + ha2)
-                         : Md5Hex(ha1 + ":" + p["nonce"] + ":" + p["nc"] + ":" + p["cnonce"] +
-                                  ":" + p["qop"] + ":" + ha2);
+    std::string expected = p["qop"].empty() ? Md5Hex(ha1 + ":" + p["nonce"] + ":" + ha2)
+                                            : Md5Hex(ha1 + ":" + p["nonce"] + ":" + p["nc"] + ":" +
+                                                     p["cnonce"] + ":" + p["qop"] + ":" + ha2);
     return expected == p["response"];
 }
 
@@ -111,8 +110,9 @@ void Challenge(httplib::Response& res) {
                  static_cast<unsigned long long>(rng()));
     }
     res.status = 401;
-    res.set_header("WWW-Authenticate", std::string("Digest realm=\"camsim\", qop=\"auth\", nonce=\"") +
-                                           nonce + "\", algorithm=MD5");
+    res.set_header("WWW-Authenticate",
+                   std::string("Digest realm=\"camsim\", qop=\"auth\", nonce=\"") + nonce +
+                       "\", algorithm=MD5");
     res.set_content("Unauthorized\n", "text/plain");
 }
 
@@ -128,7 +128,8 @@ void SendBody(State& state, httplib::Response& res, int status, const std::strin
         bool chunked = delivery == "chunked";
         auto provider = [data, sent, drop, chunked](size_t, httplib::DataSink& sink) {
             for (size_t off = 0; off < sent; off += 1024)
-                if (!sink.write(data->data() + off, std::min<size_t>(1024, sent - off))) return false;
+                if (!sink.write(data->data() + off, std::min<size_t>(1024, sent - off)))
+                    return false;
             if (drop) return false;
             // Without a length the end of the body is the close; the server
             // library would keep the connection open after done(), so the
@@ -164,11 +165,19 @@ std::string CurrentToken(State& state) {
 
 void Serve(State& state, httplib::Server& svr) {
     svr.new_task_queue = [] { return new httplib::ThreadPool(32); };
+    // Headers and body go out in separate writes; without this, Nagle and the
+    // client's delayed ACK add ~40 ms to every reply.
+    svr.set_tcp_nodelay(true);
 
     svr.set_pre_routing_handler([&state](const httplib::Request& req, httplib::Response& res) {
         if (IsControl(req.path)) return httplib::Server::HandlerResponse::Unhandled;
+        {
+            std::lock_guard<std::mutex> lock(state.mu);
+            ++state.requests;
+        }
         long delay = atol(state.Fault("delay_ms").c_str());
-        if (delay > 0) std::this_thread::sleep_for(std::chrono::milliseconds(std::min(delay, 60000L)));
+        if (delay > 0)
+            std::this_thread::sleep_for(std::chrono::milliseconds(std::min(delay, 60000L)));
         int status = atoi(state.Fault("status").c_str());
         if (status > 0) {
             res.status = status;
@@ -211,8 +220,10 @@ void Serve(State& state, httplib::Server& svr) {
                     if (i > 0) std::this_thread::sleep_for(std::chrono::milliseconds(100));
                     std::string jpeg = PresetJpeg(CurrentToken(*s), 160, 90);
                     // Even frames carry a Content-Length, odd ones only the boundary.
-                    std::string part = std::string("--") + kBoundary + "\r\nContent-Type: image/jpeg\r\n";
-                    if (i % 2 == 0) part += "Content-Length: " + std::to_string(jpeg.size()) + "\r\n";
+                    std::string part =
+                        std::string("--") + kBoundary + "\r\nContent-Type: image/jpeg\r\n";
+                    if (i % 2 == 0)
+                        part += "Content-Length: " + std::to_string(jpeg.size()) + "\r\n";
                     part += "\r\n" + jpeg + "\r\n";
                     size_t n = (drop && i == 1) ? part.size() / 2 : part.size();
                     if (!sink.is_writable() || !sink.write(part.data(), n)) return false;
@@ -266,6 +277,10 @@ void Serve(State& state, httplib::Server& svr) {
         char t[40];
         snprintf(t, sizeof t, "%.6f\n", state.Now());
         res.set_content(t, "text/plain");
+    });
+    svr.Get("/control/requests", [&state](const httplib::Request&, httplib::Response& res) {
+        std::lock_guard<std::mutex> lock(state.mu);
+        res.set_content(std::to_string(state.requests) + "\n", "text/plain");
     });
     svr.Get("/control/current", [&state](const httplib::Request&, httplib::Response& res) {
         res.set_content(CurrentToken(state) + "\n", "text/plain");

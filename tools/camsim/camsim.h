@@ -25,11 +25,12 @@ struct Move {
 struct State {
     std::mutex mu;
     std::string user = "admin", password = "secret";
-    int port = 0;                          // the port we listen on
-    std::vector<Preset> presets;           // in the order the camera lists them
-    std::vector<Move> moves;               // accepted GotoPreset requests
+    int port = 0;                 // the port we listen on
+    std::vector<Preset> presets;  // in the order the camera lists them
+    std::vector<Move> moves;      // accepted GotoPreset requests
     std::map<std::string, std::string> faults;
-    std::string current;                   // token of the preset we are at ("" none yet)
+    std::string current;  // token of the preset we are at ("" none yet)
+    long requests = 0;    // requests received, control endpoints aside
     std::chrono::steady_clock::time_point start = std::chrono::steady_clock::now();
 
     std::string Fault(const std::string& name);  // "" when not set

@@ -48,12 +48,23 @@ std::string Escape(const std::string& s) {
     std::string out;
     for (char c : s) {
         switch (c) {
-            case '&': out += "&amp;"; break;
-            case '<': out += "&lt;"; break;
-            case '>': out += "&gt;"; break;
-            case '"': out += "&quot;"; break;
-            case '\'': out += "&apos;"; break;
-            default: out += c;
+            case '&':
+                out += "&amp;";
+                break;
+            case '<':
+                out += "&lt;";
+                break;
+            case '>':
+                out += "&gt;";
+                break;
+            case '"':
+                out += "&quot;";
+                break;
+            case '\'':
+                out += "&apos;";
+                break;
+            default:
+                out += c;
         }
     }
     return out;
@@ -85,7 +96,8 @@ SoapReply Fault(State& state, int status, const char* code, const char* subcode,
     SoapReply r = Envelope(std::string("<env:Fault><env:Code><env:Value>") + code +
                            "</env:Value><env:Subcode><env:Value>" + subcode +
                            "</env:Value></env:Subcode></env:Code><env:Reason><env:Text "
-                           "xml:lang=\"en\">" + reason + "</env:Text></env:Reason></env:Fault>");
+                           "xml:lang=\"en\">" +
+                           reason + "</env:Text></env:Reason></env:Fault>");
     std::string forced = state.Fault("fault_http_status");
     r.status = forced.empty() ? status : atoi(forced.c_str());
     return r;
@@ -138,7 +150,8 @@ int CheckUsernameToken(State& state, pugi::xml_node header) {
     pugi::xml_node pw = Child(token, "Password");
     if (ChildText(token, "Username") != user) return -1;
     std::string type = pw.attribute("Type").as_string();
-    if (type.find("PasswordText") != std::string::npos) return pw.text().as_string() == password ? 1 : -1;
+    if (type.find("PasswordText") != std::string::npos)
+        return pw.text().as_string() == password ? 1 : -1;
     std::string nonce = Base64Decode(ChildText(token, "Nonce"));
     std::string created = ChildText(token, "Created");
     if (Base64Encode(Sha1(nonce + created + password)) != pw.text().as_string()) return -1;
@@ -180,7 +193,9 @@ SoapReply GetCapabilities(State& state) {
     std::string base = BaseAddress(state);
     return Envelope(
         "<tds:GetCapabilitiesResponse><tds:Capabilities>"
-        "<tt:Device><tt:XAddr>" + base + "/onvif/device_service</tt:XAddr>"
+        "<tt:Device><tt:XAddr>" +
+        base +
+        "/onvif/device_service</tt:XAddr>"
         "<tt:Network><tt:IPFilter>false</tt:IPFilter><tt:ZeroConfiguration>false"
         "</tt:ZeroConfiguration><tt:IPVersion6>false</tt:IPVersion6><tt:DynDNS>false</tt:DynDNS>"
         "</tt:Network><tt:System><tt:DiscoveryResolve>false</tt:DiscoveryResolve>"
@@ -193,33 +208,35 @@ SoapReply GetCapabilities(State& state) {
         "</tt:AccessPolicyConfig><tt:X.509Token>false</tt:X.509Token><tt:SAMLToken>false"
         "</tt:SAMLToken><tt:KerberosToken>false</tt:KerberosToken><tt:RELToken>false"
         "</tt:RELToken></tt:Security></tt:Device>"
-        "<tt:Media><tt:XAddr>" + base + MediaPath(state) + "</tt:XAddr>"
+        "<tt:Media><tt:XAddr>" +
+        base + MediaPath(state) +
+        "</tt:XAddr>"
         "<tt:StreamingCapabilities><tt:RTPMulticast>false</tt:RTPMulticast><tt:RTP_TCP>true"
         "</tt:RTP_TCP><tt:RTP_RTSP_TCP>true</tt:RTP_RTSP_TCP></tt:StreamingCapabilities>"
         "</tt:Media>"
-        "<tt:PTZ><tt:XAddr>" + base + PtzPath(state) + "</tt:XAddr></tt:PTZ>"
+        "<tt:PTZ><tt:XAddr>" +
+        base + PtzPath(state) +
+        "</tt:XAddr></tt:PTZ>"
         "</tds:Capabilities></tds:GetCapabilitiesResponse>");
 }
 
 std::string ServiceXml(const std::string& ns, const std::string& xaddr, int major, int minor) {
     return "<tds:Service><tds:Namespace>" + ns + "</tds:Namespace><tds:XAddr>" + xaddr +
-           "</tds:XAddr><tds:Version><tt:Major>" + std::to_string(major) +
-           "</tt:Major><tt:Minor>" + std::to_string(minor) +
-           "</tt:Minor></tds:Version></tds:Service>";
+           "</tds:XAddr><tds:Version><tt:Major>" + std::to_string(major) + "</tt:Major><tt:Minor>" +
+           std::to_string(minor) + "</tt:Minor></tds:Version></tds:Service>";
 }
 
 SoapReply GetServices(State& state) {
     if (state.Fault("no_get_services") == "1")
         return Fault(state, 500, "env:Receiver", "ter:ActionNotSupported", "Not supported");
     std::string base = BaseAddress(state);
-    return Envelope("<tds:GetServicesResponse>" +
-                    ServiceXml("http://www.onvif.org/ver10/device/wsdl",
-                               base + "/onvif/device_service", 2, 40) +
-                    ServiceXml("http://www.onvif.org/ver10/media/wsdl", base + MediaPath(state), 2,
-                               40) +
-                    ServiceXml("http://www.onvif.org/ver20/ptz/wsdl", base + PtzPath(state), 2,
-                               40) +
-                    "</tds:GetServicesResponse>");
+    return Envelope(
+        "<tds:GetServicesResponse>" +
+        ServiceXml("http://www.onvif.org/ver10/device/wsdl", base + "/onvif/device_service", 2,
+                   40) +
+        ServiceXml("http://www.onvif.org/ver10/media/wsdl", base + MediaPath(state), 2, 40) +
+        ServiceXml("http://www.onvif.org/ver20/ptz/wsdl", base + PtzPath(state), 2, 40) +
+        "</tds:GetServicesResponse>");
 }
 
 SoapReply GetDeviceInformation(State& state) {
@@ -231,7 +248,9 @@ SoapReply GetDeviceInformation(State& state) {
     return Envelope(
         "<tds:GetDeviceInformationResponse><tds:Manufacturer>CamSim</tds:Manufacturer>"
         "<tds:Model>CamSim PTZ</tds:Model><tds:FirmwareVersion>1.0</tds:FirmwareVersion>"
-        "<tds:SerialNumber>CS-" + std::to_string(port) + "</tds:SerialNumber>"
+        "<tds:SerialNumber>CS-" +
+        std::to_string(port) +
+        "</tds:SerialNumber>"
         "<tds:HardwareId>camsim</tds:HardwareId></tds:GetDeviceInformationResponse>");
 }
 
@@ -271,9 +290,11 @@ std::string PtzConfigurationXml() {
 }
 
 std::string EncoderXml(const Profile& p) {
-    return std::string("<tt:Name>") + p.encoder + "</tt:Name><tt:UseCount>1</tt:UseCount>"
-           "<tt:Encoding>H264</tt:Encoding><tt:Resolution><tt:Width>" + std::to_string(p.width) +
-           "</tt:Width><tt:Height>" + std::to_string(p.height) + "</tt:Height></tt:Resolution>"
+    return std::string("<tt:Name>") + p.encoder +
+           "</tt:Name><tt:UseCount>1</tt:UseCount>"
+           "<tt:Encoding>H264</tt:Encoding><tt:Resolution><tt:Width>" +
+           std::to_string(p.width) + "</tt:Width><tt:Height>" + std::to_string(p.height) +
+           "</tt:Height></tt:Resolution>"
            "<tt:Quality>5</tt:Quality><tt:RateControl><tt:FrameRateLimit>25</tt:FrameRateLimit>"
            "<tt:EncodingInterval>1</tt:EncodingInterval><tt:BitrateLimit>4096</tt:BitrateLimit>"
            "</tt:RateControl><tt:H264><tt:GovLength>50</tt:GovLength><tt:H264Profile>Main"
@@ -286,17 +307,17 @@ std::string EncoderXml(const Profile& p) {
 std::string ProfileXml(const char* element, const Profile& p) {
     const VideoSource& vs = kSources[p.source];
     std::string vsc = std::string("VSC_") + std::to_string(p.source + 1);
-    std::string out = std::string("<") + element + " token=\"" + p.token + "\" fixed=\"true\">" +
-                      "<tt:Name>" + p.name + "</tt:Name>" +
-                      "<tt:VideoSourceConfiguration token=\"" + vsc + "\"><tt:Name>" + vsc +
-                      "</tt:Name><tt:UseCount>2</tt:UseCount><tt:SourceToken>" + vs.token +
-                      "</tt:SourceToken><tt:Bounds x=\"0\" y=\"0\" width=\"" +
-                      std::to_string(vs.width) + "\" height=\"" + std::to_string(vs.height) +
-                      "\"/></tt:VideoSourceConfiguration>" +
-                      "<tt:VideoEncoderConfiguration token=\"" + p.encoder + "\">" + EncoderXml(p) +
-                      "</tt:VideoEncoderConfiguration>";
-    if (p.ptz) out += "<tt:PTZConfiguration token=\"PTZC_1\">" + PtzConfigurationXml() +
-                      "</tt:PTZConfiguration>";
+    std::string out =
+        std::string("<") + element + " token=\"" + p.token + "\" fixed=\"true\">" + "<tt:Name>" +
+        p.name + "</tt:Name>" + "<tt:VideoSourceConfiguration token=\"" + vsc + "\"><tt:Name>" +
+        vsc + "</tt:Name><tt:UseCount>2</tt:UseCount><tt:SourceToken>" + vs.token +
+        "</tt:SourceToken><tt:Bounds x=\"0\" y=\"0\" width=\"" + std::to_string(vs.width) +
+        "\" height=\"" + std::to_string(vs.height) + "\"/></tt:VideoSourceConfiguration>" +
+        "<tt:VideoEncoderConfiguration token=\"" + p.encoder + "\">" + EncoderXml(p) +
+        "</tt:VideoEncoderConfiguration>";
+    if (p.ptz)
+        out += "<tt:PTZConfiguration token=\"PTZC_1\">" + PtzConfigurationXml() +
+               "</tt:PTZConfiguration>";
     out += std::string("</") + element + ">";
     return out;
 }
@@ -375,7 +396,8 @@ SoapReply GetPresets(State& state, pugi::xml_node request) {
         char pos[200];
         snprintf(pos, sizeof pos,
                  "<tt:PTZPosition><tt:PanTilt x=\"%.2f\" y=\"0\"/><tt:Zoom x=\"0\"/>"
-                 "</tt:PTZPosition>", (i++ % 20) / 10.0 - 1.0);
+                 "</tt:PTZPosition>",
+                 (i++ % 20) / 10.0 - 1.0);
         // A preset with an empty token is listed without the attribute.
         inner += "<tptz:Preset";
         if (!p.token.empty()) inner += " token=\"" + Escape(p.token) + "\"";
@@ -387,7 +409,8 @@ SoapReply GetPresets(State& state, pugi::xml_node request) {
 SoapReply GotoPreset(State& state, pugi::xml_node request) {
     if (!PtzProfile(request)) return NoPtzProfile(state);
     std::string token = ChildText(request, "PresetToken");
-    fprintf(stderr, "camsim: GotoPreset token=\"%s\"\n", token.c_str());
+    static const bool quiet = getenv("CAMSIM_QUIET") != nullptr;
+    if (!quiet) fprintf(stderr, "camsim: GotoPreset token=\"%s\"\n", token.c_str());
     if (!token.empty() && token == state.Fault("refuse"))
         return Fault(state, 500, "env:Receiver", "ter:Action", "Preset refused");
     std::lock_guard<std::mutex> lock(state.mu);
@@ -504,8 +527,8 @@ SoapReply HandleSoap(State& state, const std::string& service, const std::string
     if (!request) return Fault(state, 400, "env:Sender", "ter:WellFormed", "Empty body");
     std::string action = LocalName(request.name());
 
-    bool open = service == "device" && action == "GetSystemDateAndTime" &&
-                state.Fault("time_auth") != "1";
+    bool open =
+        service == "device" && action == "GetSystemDateAndTime" && state.Fault("time_auth") != "1";
     if (!open && !httpAuthorized) {
         if (state.Fault("http_auth_only") == "1") {
             SoapReply r;

@@ -1,0 +1,409 @@
+// ONVIF SOAP 1.2 messages (see onvif_soap.h).
+#include "hostlib/onvif_soap.h"
+
+#include <limits.h>
+#include <openssl/evp.h>
+#include <openssl/sha.h>
+#include <string.h>
+
+#include <cstdint>
+#include <pugixml.hpp>
+
+namespace onvif {
+
+const char* const kNsSoap = "http://www.w3.org/2003/05/soap-envelope";
+const char* const kNsSchema = "http://www.onvif.org/ver10/schema";
+const char* const kNsDevice = "http://www.onvif.org/ver10/device/wsdl";
+const char* const kNsMedia = "http://www.onvif.org/ver10/media/wsdl";
+const char* const kNsPtz = "http://www.onvif.org/ver20/ptz/wsdl";
+
+namespace {
+
+const char* const kNsSoap11 = "http://schemas.xmlsoap.org/soap/envelope/";
+const char* const kNsWsse =
+    "http://docs.oasis-open.org/wss/2004/01/oasis-200401-wss-wssecurity-secext-1.0.xsd";
+const char* const kNsWsu =
+    "http://docs.oasis-open.org/wss/2004/01/oasis-200401-wss-wssecurity-utility-1.0.xsd";
+
+std::string Escape(const std::string& s) {
+    std::string out;
+    for (char c : s) {
+        switch (c) {
+            case '&':
+                out += "&amp;";
+                break;
+            case '<':
+                out += "&lt;";
+                break;
+            case '>':
+                out += "&gt;";
+                break;
+            case '"':
+                out += "&quot;";
+                break;
+            case '\'':
+                out += "&apos;";
+                break;
+            default:
+                out += c;
+        }
+    }
+    return out;
+}
+
+const char* LocalName(const char* name) {
+    const char* colon = strchr(name, ':');
+    return colon ? colon + 1 : name;
+}
+
+// The namespace URI of an element: its prefix resolved through the xmlns
+// declarations of the element and its ancestors.
+std::string NamespaceOf(pugi::xml_node node) {
+    const char* name = node.name();
+    const char* colon = strchr(name, ':');
+    std::string attr = colon ? "xmlns:" + std::string(name, colon - name) : std::string("xmlns");
+    for (pugi::xml_node n = node; n; n = n.parent()) {
+        if (n.type() != pugi::node_element) continue;
+        pugi::xml_attribute a = n.attribute(attr.c_str());
+        if (a) return a.value();
+    }
+    return "";
+}
+
+bool Matches(pugi::xml_node node, const char* ns, const char* local) {
+    return node.type() == pugi::node_element && strcmp(LocalName(node.name()), local) == 0 &&
+           NamespaceOf(node) == ns;
+}
+
+pugi::xml_node Child(pugi::xml_node node, const char* ns, const char* local) {
+    for (pugi::xml_node c = node.first_child(); c; c = c.next_sibling())
+        if (Matches(c, ns, local)) return c;
+    return {};
+}
+
+std::vector<pugi::xml_node> Children(pugi::xml_node node, const char* ns, const char* local) {
+    std::vector<pugi::xml_node> out;
+    for (pugi::xml_node c = node.first_child(); c; c = c.next_sibling())
+        if (Matches(c, ns, local)) out.push_back(c);
+    return out;
+}
+
+std::string Trimmed(const char* text) {
+    std::string s = text;
+    size_t b = s.find_first_not_of(" \t\r\n");
+    if (b == std::string::npos) return "";
+    size_t e = s.find_last_not_of(" \t\r\n");
+    return s.substr(b, e - b + 1);
+}
+
+std::string Text(pugi::xml_node node) { return Trimmed(node.text().as_string()); }
+
+std::string Request(const char* prefix, const char* ns, const char* name,
+                    const std::string& inner = "") {
+    std::string open = std::string(prefix) + ":" + name;
+    if (inner.empty()) return "<" + open + " xmlns:" + prefix + "=\"" + ns + "\"/>";
+    return "<" + open + " xmlns:" + prefix + "=\"" + ns + "\">" + inner + "</" + open + ">";
+}
+
+std::string Element(const char* prefix, const char* name, const std::string& value) {
+    std::string tag = std::string(prefix) + ":" + name;
+    return "<" + tag + ">" + Escape(value) + "</" + tag + ">";
+}
+
+uint32_t Fnv1a(const std::string& s) {
+    uint32_t h = 2166136261u;
+    for (unsigned char c : s) h = (h ^ c) * 16777619u;
+    return h;
+}
+
+}  // namespace
+
+// ---- requests ----
+
+std::string Base64(const std::string& bytes) {
+    std::string out(4 * ((bytes.size() + 2) / 3) + 1, '\0');
+    int n = EVP_EncodeBlock(reinterpret_cast<unsigned char*>(&out[0]),
+                            reinterpret_cast<const unsigned char*>(bytes.data()),
+                            static_cast<int>(bytes.size()));
+    out.resize(n > 0 ? static_cast<size_t>(n) : 0);
+    return out;
+}
+
+std::string PasswordDigest(const std::string& nonce, const std::string& created,
+                           const std::string& password) {
+    // The digest is fetched once: a fetch per call costs more than the hash.
+    static EVP_MD* const sha1 = EVP_MD_fetch(nullptr, "SHA1", nullptr);
+    std::string input = nonce + created + password;
+    unsigned char d[SHA_DIGEST_LENGTH];
+    unsigned int len = 0;
+    if (!sha1 || !EVP_Digest(input.data(), input.size(), d, &len, sha1, nullptr)) return "";
+    return Base64(std::string(reinterpret_cast<char*>(d), len));
+}
+
+std::string FormatUtc(time_t t) {
+    struct tm tm;
+    gmtime_r(&t, &tm);
+    char buf[32];
+    strftime(buf, sizeof buf, "%Y-%m-%dT%H:%M:%SZ", &tm);
+    return buf;
+}
+
+std::string Envelope(const std::string& body, const UsernameToken* token) {
+    std::string out =
+        std::string("<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<s:Envelope xmlns:s=\"") +
+        kNsSoap + "\">";
+    if (token) {
+        out += std::string("<s:Header><wsse:Security s:mustUnderstand=\"1\" xmlns:wsse=\"") +
+               kNsWsse + "\" xmlns:wsu=\"" + kNsWsu + "\"><wsse:UsernameToken>" +
+               Element("wsse", "Username", token->user) +
+               "<wsse:Password Type=\"http://docs.oasis-open.org/wss/2004/01/"
+               "oasis-200401-wss-username-token-profile-1.0#PasswordDigest\">" +
+               PasswordDigest(token->nonce, token->created, token->password) +
+               "</wsse:Password><wsse:Nonce EncodingType=\"http://docs.oasis-open.org/wss/2004/01/"
+               "oasis-200401-wss-soap-message-security-1.0#Base64Binary\">" +
+               Base64(token->nonce) + "</wsse:Nonce>" + Element("wsu", "Created", token->created) +
+               "</wsse:UsernameToken></wsse:Security></s:Header>";
+    }
+    out += "<s:Body>" + body + "</s:Body></s:Envelope>";
+    return out;
+}
+
+std::string GetSystemDateAndTimeBody() { return Request("tds", kNsDevice, "GetSystemDateAndTime"); }
+std::string GetServicesBody() {
+    return Request("tds", kNsDevice, "GetServices", Element("tds", "IncludeCapability", "false"));
+}
+std::string GetCapabilitiesBody() {
+    return Request("tds", kNsDevice, "GetCapabilities", Element("tds", "Category", "All"));
+}
+std::string GetProfilesBody() { return Request("trt", kNsMedia, "GetProfiles"); }
+std::string GetSnapshotUriBody(const std::string& profile) {
+    return Request("trt", kNsMedia, "GetSnapshotUri", Element("trt", "ProfileToken", profile));
+}
+std::string GetPresetsBody(const std::string& profile) {
+    return Request("tptz", kNsPtz, "GetPresets", Element("tptz", "ProfileToken", profile));
+}
+std::string GotoPresetBody(const std::string& profile, const std::string& presetToken) {
+    return Request(
+        "tptz", kNsPtz, "GotoPreset",
+        Element("tptz", "ProfileToken", profile) + Element("tptz", "PresetToken", presetToken));
+}
+
+std::string ActionOf(const std::string& body) {
+    // Our own request text: "<p:Name xmlns:p=\"NS\"...".
+    size_t colon = body.find(':');
+    size_t end = body.find(' ');
+    size_t q1 = body.find('"');
+    size_t q2 = q1 == std::string::npos ? q1 : body.find('"', q1 + 1);
+    if (colon == std::string::npos || end == std::string::npos || q2 == std::string::npos)
+        return "";
+    return body.substr(q1 + 1, q2 - q1 - 1) + "/" + body.substr(colon + 1, end - colon - 1);
+}
+
+// ---- replies ----
+
+struct Reply::Impl {
+    pugi::xml_document doc;
+    pugi::xml_node body;  // first element of the Body
+};
+
+Reply::Reply() : impl_(new Impl) {}
+Reply::~Reply() { delete impl_; }
+
+bool Reply::Parse(const std::string& text) {
+    fault_.reset();
+    impl_->body = pugi::xml_node();
+    if (!impl_->doc.load_buffer(text.data(), text.size())) return false;
+    pugi::xml_node envelope = impl_->doc.document_element();
+    const char* soap = kNsSoap;
+    if (!Matches(envelope, soap, "Envelope")) {
+        soap = kNsSoap11;
+        if (!Matches(envelope, soap, "Envelope")) return false;
+    }
+    pugi::xml_node body = Child(envelope, soap, "Body");
+    if (!body) return false;
+    for (pugi::xml_node c = body.first_child(); c; c = c.next_sibling())
+        if (c.type() == pugi::node_element) {
+            impl_->body = c;
+            break;
+        }
+    if (!impl_->body) return false;
+    if (Matches(impl_->body, soap, "Fault")) {
+        Fault f;
+        pugi::xml_node fault = impl_->body;
+        if (soap == kNsSoap) {
+            pugi::xml_node code = Child(fault, soap, "Code");
+            f.code = Text(Child(code, soap, "Value"));
+            f.subcode = Text(Child(Child(code, soap, "Subcode"), soap, "Value"));
+            f.reason = Text(Child(Child(fault, soap, "Reason"), soap, "Text"));
+        } else {  // SOAP 1.1: unqualified children
+            f.code = Text(fault.child("faultcode"));
+            f.reason = Text(fault.child("faultstring"));
+        }
+        fault_ = f;
+    }
+    return true;
+}
+
+bool Reply::Is(const char* ns, const char* local) const {
+    return !fault_ && Matches(impl_->body, ns, local);
+}
+
+std::optional<time_t> Reply::SystemDateAndTimeUtc() const {
+    if (!Is(kNsDevice, "GetSystemDateAndTimeResponse")) return std::nullopt;
+    pugi::xml_node utc =
+        Child(Child(impl_->body, kNsDevice, "SystemDateAndTime"), kNsSchema, "UTCDateTime");
+    pugi::xml_node time = Child(utc, kNsSchema, "Time");
+    pugi::xml_node date = Child(utc, kNsSchema, "Date");
+    if (!time || !date) return std::nullopt;
+    struct tm tm = {};
+    tm.tm_hour = Child(time, kNsSchema, "Hour").text().as_int(-1);
+    tm.tm_min = Child(time, kNsSchema, "Minute").text().as_int(-1);
+    tm.tm_sec = Child(time, kNsSchema, "Second").text().as_int(-1);
+    tm.tm_year = Child(date, kNsSchema, "Year").text().as_int(0) - 1900;
+    tm.tm_mon = Child(date, kNsSchema, "Month").text().as_int(0) - 1;
+    tm.tm_mday = Child(date, kNsSchema, "Day").text().as_int(0);
+    if (tm.tm_hour < 0 || tm.tm_hour > 23 || tm.tm_min < 0 || tm.tm_min > 59 || tm.tm_sec < 0 ||
+        tm.tm_sec > 60 || tm.tm_year < 70 || tm.tm_mon < 0 || tm.tm_mon > 11 || tm.tm_mday < 1 ||
+        tm.tm_mday > 31)
+        return std::nullopt;
+    return timegm(&tm);
+}
+
+Reply::Addresses Reply::Services() const {
+    Addresses a;
+    if (!Is(kNsDevice, "GetServicesResponse")) return a;
+    for (pugi::xml_node s : Children(impl_->body, kNsDevice, "Service")) {
+        std::string ns = Text(Child(s, kNsDevice, "Namespace"));
+        std::string xaddr = Text(Child(s, kNsDevice, "XAddr"));
+        if (ns == kNsMedia && a.media.empty()) a.media = xaddr;
+        if (ns == kNsPtz && a.ptz.empty()) a.ptz = xaddr;
+    }
+    return a;
+}
+
+Reply::Addresses Reply::Capabilities() const {
+    Addresses a;
+    if (!Is(kNsDevice, "GetCapabilitiesResponse")) return a;
+    pugi::xml_node caps = Child(impl_->body, kNsDevice, "Capabilities");
+    a.media = Text(Child(Child(caps, kNsSchema, "Media"), kNsSchema, "XAddr"));
+    a.ptz = Text(Child(Child(caps, kNsSchema, "PTZ"), kNsSchema, "XAddr"));
+    return a;
+}
+
+std::vector<Reply::Profile> Reply::Profiles() const {
+    std::vector<Profile> out;
+    if (!Is(kNsMedia, "GetProfilesResponse")) return out;
+    for (pugi::xml_node p : Children(impl_->body, kNsMedia, "Profiles")) {
+        Profile profile;
+        profile.token = p.attribute("token").as_string();
+        if (profile.token.empty()) continue;
+        profile.sourceToken =
+            Text(Child(Child(p, kNsSchema, "VideoSourceConfiguration"), kNsSchema, "SourceToken"));
+        pugi::xml_node reso =
+            Child(Child(p, kNsSchema, "VideoEncoderConfiguration"), kNsSchema, "Resolution");
+        profile.width = Child(reso, kNsSchema, "Width").text().as_int(0);
+        profile.height = Child(reso, kNsSchema, "Height").text().as_int(0);
+        profile.ptz = static_cast<bool>(Child(p, kNsSchema, "PTZConfiguration"));
+        out.push_back(profile);
+    }
+    return out;
+}
+
+std::string Reply::SnapshotUri() const {
+    if (!Is(kNsMedia, "GetSnapshotUriResponse")) return "";
+    return Text(Child(Child(impl_->body, kNsMedia, "MediaUri"), kNsSchema, "Uri"));
+}
+
+std::vector<Reply::Preset> Reply::Presets() const {
+    std::vector<Preset> out;
+    if (!Is(kNsPtz, "GetPresetsResponse")) return out;
+    for (pugi::xml_node p : Children(impl_->body, kNsPtz, "Preset")) {
+        Preset preset;
+        preset.token = p.attribute("token").as_string();
+        if (preset.token.empty() || preset.token.size() > 64) continue;
+        preset.name = Text(Child(p, kNsSchema, "Name"));
+        out.push_back(preset);
+    }
+    return out;
+}
+
+// ---- positions, addresses ----
+
+std::optional<int> DecimalToken(const std::string& token) {
+    if (token.empty() || token.size() > 10) return std::nullopt;
+    if (token.size() > 1 && token[0] == '0') return std::nullopt;
+    long long v = 0;
+    for (char c : token) {
+        if (c < '0' || c > '9') return std::nullopt;
+        v = v * 10 + (c - '0');
+    }
+    if (v > INT_MAX) return std::nullopt;
+    return static_cast<int>(v);
+}
+
+int PresetPosition(const std::string& token) {
+    if (auto v = DecimalToken(token)) return *v;
+    return -1 - static_cast<int>(Fnv1a(token) & 0x7fffffffu);
+}
+
+std::string PresetToken(int position) {
+    return position >= 0 ? std::to_string(position) : std::string();
+}
+
+std::map<int, std::string> MapPresets(const std::vector<Reply::Preset>& presets) {
+    std::map<int, std::string> out;
+    for (const Reply::Preset& p : presets) {
+        int position = PresetPosition(p.token);
+        if (position >= 0) {
+            out.emplace(position, p.token);  // a repeated token keeps its first entry
+            continue;
+        }
+        bool repeated = false;
+        for (const auto& e : out) repeated = repeated || e.second == p.token;
+        if (repeated) continue;
+        while (out.count(position)) position = position == INT_MIN ? -1 : position - 1;
+        out.emplace(position, p.token);
+    }
+    return out;
+}
+
+std::optional<Url> ParseUrl(const std::string& url) {
+    Url u;
+    size_t scheme = url.find("://");
+    if (scheme == std::string::npos) return std::nullopt;
+    u.scheme = url.substr(0, scheme);
+    for (char& c : u.scheme) c = static_cast<char>(tolower(static_cast<unsigned char>(c)));
+    size_t hostStart = scheme + 3;
+    size_t pathStart = url.find_first_of("/?", hostStart);
+    std::string authority = url.substr(
+        hostStart, pathStart == std::string::npos ? std::string::npos : pathStart - hostStart);
+    size_t at = authority.rfind('@');
+    if (at != std::string::npos) authority = authority.substr(at + 1);
+    std::string portText;
+    if (!authority.empty() && authority[0] == '[') {  // [v6]:port
+        size_t close = authority.find(']');
+        if (close == std::string::npos) return std::nullopt;
+        u.host = authority.substr(1, close - 1);
+        if (close + 1 < authority.size() && authority[close + 1] == ':')
+            portText = authority.substr(close + 2);
+    } else {
+        size_t colon = authority.find(':');
+        u.host = authority.substr(0, colon);
+        if (colon != std::string::npos) portText = authority.substr(colon + 1);
+    }
+    if (u.host.empty()) return std::nullopt;
+    if (!portText.empty()) {
+        for (char c : portText)
+            if (c < '0' || c > '9') return std::nullopt;
+        if (portText.size() > 5) return std::nullopt;
+        u.port = atoi(portText.c_str());
+        if (u.port <= 0 || u.port > 65535) return std::nullopt;
+    } else {
+        u.port = u.scheme == "https" ? 443 : 80;
+    }
+    u.path = pathStart == std::string::npos ? "/" : url.substr(pathStart);
+    if (u.path[0] == '?') u.path = "/" + u.path;
+    return u;
+}
+
+}  // namespace onvif
