@@ -19,37 +19,13 @@ std::string Head(const std::string& extra) { return "HTTP/1.1 200 OK\r\n" + extr
 
 double SecondsSince(Clock::time_point t) { return std::chrono::duration<double>(Clock::now() - t).count(); }
 
-TEST(OvHttpClient, OneReadReturnsOnlyWhenTheWholeLengthArrived) {
-    const std::string body = testsrv::JpegLike(100000, 1);
-    ScriptServer server([&](int fd, const std::string& request, ScriptServer&) {
-        EXPECT_EQ(request.rfind("GET /img.jpg?a=1 HTTP/1.1\r\n", 0), 0u) << request;
-        ScriptServer::Send(fd, Head("Content-Length: 100000\r\n"));
-        for (size_t at = 0; at < body.size(); at += 10000) {  // ten pieces, 20 ms apart
-            ScriptServer::Send(fd, body.substr(at, 10000));
-            std::this_thread::sleep_for(20ms);
-        }
-    });
-    OvHttpClient client("127.0.0.1", server.Port(), "/img.jpg?a=1", "", "", 5);
-    ASSERT_EQ(client.SendRequest(OV_HTTP_GET), 0);
-    int status = 0;
-    ASSERT_EQ(client.CheckResponse(status), 0);
-    EXPECT_EQ(status, 200);
-    std::string length;
-    ASSERT_EQ(client.GetHttpContent(HTTP_CONTENT_LENGTH, length), 0);
-    EXPECT_EQ(length, "100000");
-    std::string got(100000, '\0');
-    EXPECT_EQ(client.ReadData(&got[0], 100000), 100000);
-    EXPECT_TRUE(got == body);
-    char more[16];
-    EXPECT_EQ(client.ReadData(more, sizeof more), 0);
-}
-
-// Reads a body to its end in asks of `ask` bytes.
-std::string ReadAll(OvHttpClient& client, int ask, int* result) {
+// Reads a body to its end in asks of `ask` bytes; `first` gets the first read's result.
+std::string ReadAll(OvHttpClient& client, int ask, int* result, int* first) {
     std::string out;
     std::string buf(ask, '\0');
     int n;
-    while ((n = client.ReadData(&buf[0], ask)) > 0) out.append(buf, 0, n);
+    *first = client.ReadData(&buf[0], ask);
+    for (n = *first; n > 0; n = client.ReadData(&buf[0], ask)) out.append(buf, 0, n);
     *result = n;
     return out;
 }
@@ -82,15 +58,25 @@ TEST(OvHttpClient, BodiesOfEveryFraming) {
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
-        ScriptServer server([&](int fd, const std::string&, ScriptServer&) { ScriptServer::Send(fd, c.reply); });
-        OvHttpClient client("127.0.0.1", server.Port(), "/", "", "", 5);
+        // The reply in pieces 5 ms apart: a read of a known length still returns it whole.
+        ScriptServer server([&](int fd, const std::string& request, ScriptServer&) {
+            EXPECT_EQ(request.rfind("GET /img.jpg?a=1 HTTP/1.1\r\n", 0), 0u);
+            for (size_t at = 0; at < c.reply.size(); at += 10000) {
+                if (!ScriptServer::Send(fd, c.reply.substr(at, 10000))) return;
+                std::this_thread::sleep_for(5ms);
+            }
+        });
+        OvHttpClient client("127.0.0.1", server.Port(), "img.jpg?a=1", "", "", 5);
         ASSERT_EQ(client.SendRequest(OV_HTTP_GET), 0);
         int status = 0;
         ASSERT_EQ(client.CheckResponse(status), 0);
         std::string length;
         EXPECT_EQ(client.GetHttpContent(HTTP_CONTENT_LENGTH, length) == 0, c.hasLength);
-        int result = 1;
-        std::string got = ReadAll(client, 8192, &result);
+        int result = 1, first = 0;
+        std::string got = ReadAll(client, c.hasLength ? 70001 : 8192, &result, &first);
+        if (c.hasLength && c.finalResult == 0) {
+            EXPECT_EQ(first, 70001);  // one read for the whole length
+        }
         EXPECT_EQ(result < 0 ? -1 : result, c.finalResult);
         // What arrived is a prefix of the body (all of it when the read ended well).
         EXPECT_LE(got.size(), c.expected.size());
@@ -98,21 +84,6 @@ TEST(OvHttpClient, BodiesOfEveryFraming) {
         if (c.finalResult == 0) {
             EXPECT_EQ(got.size(), c.expected.size());
         }
-    }
-}
-
-TEST(OvHttpClient, StatusesAreReportedNotFollowed) {
-    for (const char* line : {"HTTP/1.1 302 Found\r\nLocation: /x\r\n", "HTTP/1.1 401 Unauthorized\r\n",
-                             "HTTP/1.1 404 Not Found\r\n"}) {
-        ScriptServer server([&](int fd, const std::string&, ScriptServer&) {
-            ScriptServer::Send(fd, std::string(line) + "Content-Length: 0\r\n\r\n");
-        });
-        OvHttpClient client("127.0.0.1", server.Port(), "/", "", "", 5);
-        ASSERT_EQ(client.SendRequest(OV_HTTP_GET), 0);
-        int status = 0;
-        ASSERT_EQ(client.CheckResponse(status), 0);
-        EXPECT_EQ(status, atoi(line + 9));
-        EXPECT_EQ(server.Connections(), 1);
     }
 }
 

@@ -139,6 +139,7 @@ Nginx::Nginx(const std::vector<std::pair<std::string, std::string>>& files) {
                    "  scgi_temp_path " + d + "/tmp;\n"
                    "  server { listen 127.0.0.1:" + std::to_string(port_) + "; root " + d + "/www;\n"
                    "    location /auth/ { auth_basic \"cam\"; auth_basic_user_file " + d + "/htpasswd; }\n"
+                   "    location = /moved.jpg { return 302 /snap.jpg; }\n"
                    "  }\n"
                    "}\n");
         process_ = std::make_unique<Process>(std::vector<std::string>{

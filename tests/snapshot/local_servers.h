@@ -53,7 +53,8 @@ private:
 
 class Nginx {
 public:
-    // Serves `files` (name -> bytes) at /<name> and at /auth/<name> (Basic auth admin:secret).
+    // Serves `files` (name -> bytes) at /<name> and at /auth/<name> (Basic auth
+    // admin:secret); /moved.jpg redirects to /snap.jpg.
     explicit Nginx(const std::vector<std::pair<std::string, std::string>>& files);
     int Port() const { return port_; }
     bool Ok() const { return ok_; }

@@ -57,6 +57,7 @@ TEST(SnapshotServers, NginxWithContentLengthAndBasicAuth) {
     EXPECT_EQ(Fetch(nginx.Port(), "/auth/snap.jpg", 1, "admin", "wrong").rc, -1);
     EXPECT_EQ(Fetch(nginx.Port(), "/auth/snap.jpg", 1).rc, -1);
     EXPECT_EQ(Fetch(nginx.Port(), "/missing.jpg", 1).rc, -1);
+    EXPECT_EQ(Fetch(nginx.Port(), "/moved.jpg", 1).rc, -1);  // redirects are not followed
     EXPECT_EQ(Fetch(nginx.Port(), "/empty.jpg", 1).rc, -1);  // Content-Length: 0
 }
 
