@@ -84,6 +84,7 @@ bool CurlTransfer::Start(const Request& request) {
         return false;
     }
     curl_->added = true;
+    kick_ = true;
     return true;
 }
 
@@ -117,10 +118,11 @@ size_t CurlTransfer::OnBody(char* data, size_t size, size_t count, void* self) {
     t->progress_ = true;
     t->headersDone_ = true;
     // curl hands the same bytes again after a pause, so take all or nothing.
-    // What the waiting read cannot take is queued only when the queue is
-    // empty: it holds at most one piece, and copying body bytes twice stays
-    // the exception.
-    if (n > t->targetLeft_ && t->Queued() > 0) {
+    // With no read waiting (still in the headers), pause at once: curl keeps
+    // the piece and hands it straight to the first read. What a waiting read
+    // cannot take is queued only when the queue is empty, so the queue holds
+    // at most one piece and body bytes are rarely copied twice.
+    if (n > t->targetLeft_ && (t->Queued() > 0 || t->target_ == nullptr)) {
         t->paused_ = true;
         return CURL_WRITEFUNC_PAUSE;
     }
@@ -141,6 +143,22 @@ size_t CurlTransfer::OnBody(char* data, size_t size, size_t count, void* self) {
 }
 
 bool CurlTransfer::Pump(Clock::time_point deadline) {
+    // Wait for activity first (as curl's own easy loop does), except when
+    // curl has work that needs no socket: just started or just unpaused.
+    if (!kick_) {
+        Clock::time_point now = Clock::now();
+        if (now >= deadline) {
+            failed_ = true;
+            return false;
+        }
+        auto wait = std::min<Clock::duration>(deadline - now, kMaxPollWait);
+        int ms = static_cast<int>(std::chrono::ceil<std::chrono::milliseconds>(wait).count());
+        if (curl_multi_poll(curl_->multi, nullptr, 0, ms, nullptr) != CURLM_OK) {
+            failed_ = true;
+            return false;
+        }
+    }
+    kick_ = false;
     int running = 0;
     if (curl_multi_perform(curl_->multi, &running) != CURLM_OK) {
         failed_ = true;
@@ -152,18 +170,6 @@ bool CurlTransfer::Pump(Clock::time_point deadline) {
             done_ = true;
             doneOk_ = msg->data.result == CURLE_OK;
         }
-    }
-    if (done_ || progress_) return true;
-    Clock::time_point now = Clock::now();
-    if (now >= deadline) {
-        failed_ = true;
-        return false;
-    }
-    auto wait = std::min<Clock::duration>(deadline - now, kMaxPollWait);
-    int ms = static_cast<int>(std::chrono::ceil<std::chrono::milliseconds>(wait).count());
-    if (curl_multi_poll(curl_->multi, nullptr, 0, ms, nullptr) != CURLM_OK) {
-        failed_ = true;
-        return false;
     }
     return true;
 }
@@ -209,6 +215,7 @@ long CurlTransfer::Read(char* dst, size_t size, bool fill) {
     if (paused_) {
         paused_ = false;
         curl_easy_pause(curl_->easy, CURLPAUSE_CONT);  // may deliver the held piece at once
+        kick_ = true;
     }
     Clock::time_point deadline = Clock::now() + timeout_;
     while (targetLeft_ > 0 && (fill || targetLeft_ == size) && !done_ && !failed_) {

@@ -1,10 +1,11 @@
 // One HTTP/1.1 GET (or empty POST) over libcurl's multi interface, read pull
 // style: the caller asks for bytes and the transfer runs only while it waits.
 // Received body bytes go straight into the caller's buffer when a read is
-// waiting; the rest of a piece that does not fit is queued, and when the
-// queue already holds a piece the write callback pauses the transfer. So the
-// queue never holds more than one piece of curl's receive buffer (64 KiB) and
-// memory stays bounded whatever the server sends.
+// waiting; the rest of a piece that does not fit is queued. With no read
+// waiting, or when the queue already holds a piece, the write callback pauses
+// the transfer (curl then stops reading the socket). So the queue never holds
+// more than one piece of curl's receive buffer (64 KiB) and memory stays
+// bounded whatever the server sends.
 // All timing is our own deadlines in the poll loop (no CURLOPT_TIMEOUT, which
 // would cut long streams). One object per exchange, used by one thread.
 #ifndef HOSTLIB_CURL_TRANSFER_H
@@ -52,8 +53,8 @@ private:
 
     static size_t OnHeader(char* data, size_t size, size_t count, void* self);
     static size_t OnBody(char* data, size_t size, size_t count, void* self);
-    // Runs the transfer once and waits for activity until `deadline`.
-    // false: the transfer failed or the deadline passed.
+    // Waits for activity (at most until `deadline`), then runs the transfer
+    // once. false: the transfer failed or the deadline passed.
     bool Pump(Clock::time_point deadline);
     size_t Queued() const { return queue_.size() - queueHead_; }
 
@@ -66,6 +67,7 @@ private:
     bool doneOk_ = false;
     bool headersDone_ = false;
     bool paused_ = false;
+    bool kick_ = false;      // the next Pump runs the transfer without waiting
     bool progress_ = false;  // bytes arrived since the last Pump
     int status_ = 0;
     std::map<std::string, std::string> headers_;
