@@ -1,0 +1,318 @@
+// Patrol executor: the worker loop, the choice of the request to serve, and
+// the moves of one run.
+#include "executor/patrolExecutor.h"
+
+#include <syslog.h>
+
+#include <cstdint>
+#include <string>
+
+#include "host/camera.h"
+
+#define EXECUTOR_LOG(fmt, ...)                                                              \
+    syslog(LOG_ERR, "%s:%d:%s(): " fmt, "patrolExecutor.cpp", __LINE__, __func__, \
+           ##__VA_ARGS__)
+
+namespace {
+
+constexpr int kPassMicros = 250000;  // one pass of the worker loop
+constexpr unsigned long long kMicrosPerSecond = 1000000ULL;
+
+bool IsRequestType(PATROL_EXEC_TYPE type) {
+    return type == PATROL_EXEC_GUARD || type == PATROL_EXEC_DIRECT;
+}
+
+}  // namespace
+
+PatrolExecutor::PatrolExecutor()
+    : requestId{0, 0},
+      status(PATROL_STATUS_IDLE),
+      execType(PATROL_EXEC_NONE),
+      command(PATROL_CMD_NONE),
+      thread(),
+      threadStarted(false) {
+    pthread_mutex_init(&mutex, nullptr);
+    pthread_cond_init(&wake, nullptr);
+    const int rc = pthread_create(&thread, nullptr, ThreadFuncExcute, this);
+    threadStarted = (rc == 0);
+    if (!threadStarted) EXECUTOR_LOG("Create worker thread failed: %d.", rc);
+}
+
+PatrolExecutor::~PatrolExecutor() {
+    pthread_mutex_lock(&mutex);
+    command = PATROL_CMD_EXIT;
+    pthread_mutex_unlock(&mutex);
+    pthread_cond_signal(&wake);
+    if (threadStarted) pthread_join(thread, nullptr);
+    DestroyLock(&mutex);
+    pthread_cond_destroy(&wake);
+}
+
+int PatrolExecutor::Execute(int patrolId, PATROL_EXEC_TYPE type) {
+    if (!IsRequestType(type)) return -2;
+    pthread_mutex_lock(&mutex);
+    command = PATROL_CMD_EXECUTE;
+    requestId[type] = patrolId;
+    pthread_mutex_unlock(&mutex);
+    pthread_cond_signal(&wake);
+    return 0;
+}
+
+int PatrolExecutor::RemovePatrol(PATROL_EXEC_TYPE type) {
+    if (!IsRequestType(type)) return -2;
+    pthread_mutex_lock(&mutex);
+    command = (type == PATROL_EXEC_GUARD) ? PATROL_CMD_REMOVE_GUARD : PATROL_CMD_REMOVE_DIRECT;
+    requestId[type] = 0;
+    pthread_mutex_unlock(&mutex);
+    pthread_cond_signal(&wake);
+    return 0;
+}
+
+int PatrolExecutor::GetStatus() { return status.load(); }
+
+void* PatrolExecutor::ThreadFuncExcute(void* arg) {
+    PatrolExecutor* self = static_cast<PatrolExecutor*>(arg);
+    return reinterpret_cast<void*>(static_cast<intptr_t>(self->ExcuteMain()));
+}
+
+int PatrolExecutor::DestroyLock(pthread_mutex_t* lock) {
+    if (lock == nullptr) return -1;
+    if (pthread_mutex_trylock(lock) != 0) pthread_mutex_lock(lock);
+    pthread_mutex_unlock(lock);
+    pthread_mutex_destroy(lock);
+    return 0;
+}
+
+// The loop clears a taken command in the same hold of the mutex as it reads
+// it (see ExcuteMain), so that a command posted meanwhile is not wiped.
+void PatrolExecutor::ResetCommand() {
+    pthread_mutex_lock(&mutex);
+    command = PATROL_CMD_NONE;
+    pthread_mutex_unlock(&mutex);
+}
+
+void PatrolExecutor::GetExcutePatrolId(int& patrolId, PATROL_EXEC_TYPE& type) {
+    pthread_mutex_lock(&mutex);
+    if (requestId[PATROL_EXEC_DIRECT] != 0) {
+        patrolId = requestId[PATROL_EXEC_DIRECT];
+        type = PATROL_EXEC_DIRECT;
+    } else if (requestId[PATROL_EXEC_GUARD] != 0) {
+        patrolId = requestId[PATROL_EXEC_GUARD];
+        type = PATROL_EXEC_GUARD;
+    } else {
+        patrolId = 0;
+        type = PATROL_EXEC_NONE;
+    }
+    pthread_mutex_unlock(&mutex);
+}
+
+void PatrolExecutor::ClearPatrolData(int patrolId, PATROL_EXEC_TYPE type) {
+    if (!IsRequestType(type)) return;
+    pthread_mutex_lock(&mutex);
+    if (requestId[type] == patrolId) requestId[type] = 0;  // a newer request survives
+    pthread_mutex_unlock(&mutex);
+}
+
+int PatrolExecutor::ChangeExcutePatrol(Patrol& patrol) {
+    int result = 0;
+    const int currentId = patrol.GetId();
+    const PATROL_EXEC_TYPE previousType = execType;
+    int patrolId = 0;
+    PATROL_EXEC_TYPE type = PATROL_EXEC_NONE;
+    GetExcutePatrolId(patrolId, type);
+
+    if (patrolId > 0) {
+        // A guard request never displaces a direct run; the same request
+        // again leaves its run going.
+        const bool behindDirect = status.load() == PATROL_STATUS_RUNNING &&
+                                  previousType == PATROL_EXEC_DIRECT && type == PATROL_EXEC_GUARD;
+        const bool sameRun = type == previousType && patrolId == currentId;
+        if (behindDirect || sameRun) {
+            result = 1;
+        } else {
+            status = PATROL_STATUS_LOADING;
+            if (patrol.Load(patrolId) != 0) {
+                EXECUTOR_LOG("Load patrol %d failure.", patrolId);
+                result = -1;
+                if (type == PATROL_EXEC_DIRECT) {
+                    ClearPatrolData(patrolId, PATROL_EXEC_DIRECT);
+                    // The run in progress was given up when this load began. A
+                    // guard request naming it is served like any other: loaded
+                    // and started from its first preset, rather than taken for
+                    // a run that still goes on.
+                    execType = PATROL_EXEC_NONE;
+                    return ChangeExcutePatrol(patrol);
+                }
+            }
+        }
+        if (result >= 0 && patrol.GetPresetListNum() > 0) {
+            if (result == 0) {
+                execType = type;
+                status = PATROL_STATUS_RUNNING;
+            }
+            return result;
+        }
+    } else {
+        result = -1;
+    }
+
+    // The request is consumed before the executor shows idle: a guard that
+    // sees idle and posts its patrol again must not have that post wiped.
+    ClearPatrolData(patrolId, type);
+    execType = PATROL_EXEC_NONE;
+    status = PATROL_STATUS_IDLE;
+    return result;
+}
+
+int PatrolExecutor::ExcuteMain() {
+    DelayTimer pacer(kPassMicros);
+    TimeCount stayCount;
+    Patrol loadedPatrol;
+    int presetIndex = 0;
+    bool tourDone = false;
+    pacer.BeginTiming();
+
+    // First move of the run that ChangeExcutePatrol has just loaded; a failed
+    // move ends the run at once.
+    auto startRun = [&]() {
+        InitExecParam(tourDone, presetIndex, stayCount, loadedPatrol.GetStayTime());
+        if (ExecPatrol(loadedPatrol, presetIndex, tourDone) == 0) {
+            stayCount.BeginCountFromNow();
+            return true;
+        }
+        ExecFinish(loadedPatrol.GetId());
+        return false;
+    };
+    // After a run ended: one attempt at the request that is left, if any.
+    auto startNext = [&]() {
+        if (ChangeExcutePatrol(loadedPatrol) == 0) startRun();
+    };
+
+    for (;;) {
+        pthread_mutex_lock(&mutex);
+        const int taken = command;
+        if (taken == PATROL_CMD_EXECUTE || taken == PATROL_CMD_REMOVE_DIRECT ||
+            taken == PATROL_CMD_REMOVE_GUARD) {
+            command = PATROL_CMD_NONE;
+        }
+        pthread_mutex_unlock(&mutex);
+
+        switch (taken) {
+            case PATROL_CMD_NONE:
+                if (status.load() == PATROL_STATUS_RUNNING && stayCount.IsExceed() != 0) {
+                    if (ExecPatrol(loadedPatrol, presetIndex, tourDone) == 0) {
+                        stayCount.BeginCountFromNow();
+                    } else {
+                        ExecFinish(loadedPatrol.GetId());
+                        startNext();
+                    }
+                }
+                break;
+            case PATROL_CMD_EXIT:
+                return 0;
+            case PATROL_CMD_EXECUTE:
+                if (ChangeExcutePatrol(loadedPatrol) == 0 && !startRun()) startNext();
+                break;
+            case PATROL_CMD_REMOVE_DIRECT:
+                if (execType == PATROL_EXEC_DIRECT) {
+                    ExecFinish(loadedPatrol.GetId());
+                    startNext();
+                }
+                break;
+            case PATROL_CMD_REMOVE_GUARD:
+                if (execType == PATROL_EXEC_GUARD) ExecFinish(loadedPatrol.GetId());
+                break;
+            default:
+                EXECUTOR_LOG("Error command: %d.", taken);
+                break;
+        }
+
+        // Idle with no command: the passes would do nothing, so sleep until
+        // a command is posted and act on it at once, on a new grid.
+        bool waited = false;
+        pthread_mutex_lock(&mutex);
+        while (command == PATROL_CMD_NONE && status.load() == PATROL_STATUS_IDLE) {
+            pthread_cond_wait(&wake, &mutex);
+            waited = true;
+        }
+        pthread_mutex_unlock(&mutex);
+        if (waited) {
+            pacer.BeginTiming();
+        } else {
+            pacer.Delay();
+        }
+    }
+}
+
+// ---- one run ----
+
+void PatrolExecutor::InitExecParam(bool& tourDone, int& presetIndex, TimeCount& stayCount,
+                                   int stayTime) {
+    presetIndex = 0;
+    tourDone = false;
+    // Formed in 64 bits: any int stay time fits; a negative one counts as 0.
+    const unsigned long long seconds = stayTime > 0 ? static_cast<unsigned long long>(stayTime) : 0;
+    stayCount.SetCountingTime(seconds * kMicrosPerSecond);
+}
+
+int PatrolExecutor::ExecPatrol(Patrol& patrol, int& presetIndex, bool& tourDone) {
+    Camera camera;
+    PRESET_INFO preset{0, std::string()};
+    std::string presetName;
+
+    if (patrol.GetPresetListNum() == 0) {
+        EXECUTOR_LOG("No preset to execute.");
+        return -1;
+    }
+    if (presetIndex >= patrol.GetPresetListNum()) {
+        EXECUTOR_LOG("Parameter error.");
+        return -2;
+    }
+    if (patrol.GetPresetFromList(presetIndex, &preset) != 0) {
+        EXECUTOR_LOG("Get preset information failure.");
+        return -1;
+    }
+    if (camera.Load(patrol.GetCamId(), 0) != 0) {
+        EXECUTOR_LOG("Get camera info. [%d] failed.", patrol.GetCamId());
+        return -1;
+    }
+    CameraAPI* api = nullptr;
+    {
+        const std::string host = camera.GetHost();
+        const int port = camera.GetPort();
+        const std::string username = camera.GetUsername();
+        const std::string password = camera.GetPassword();
+        const std::string vendor = camera.GetVendor();
+        const std::string model = camera.GetModel();
+        const std::string channel = camera.GetCH();
+        api = newCameraAPI(host, port, username, password, vendor, model, channel);
+    }
+    if (api == nullptr) {
+        EXECUTOR_LOG("Get camera API failed.");
+        return -1;
+    }
+    presetName = "kelo" + itos(preset.position);
+    if (api->GoPreset(preset.position, presetName) != 0) {
+        EXECUTOR_LOG("Go to camera preset failed. Position=%d, Name=%s", preset.position,
+                     presetName.c_str());
+        releaseCameraAPI(api);
+        return -1;
+    }
+    releaseCameraAPI(api);
+
+    if (tourDone) return -1;  // the closing move back to the first preset
+    ++presetIndex;
+    if (presetIndex >= patrol.GetPresetListNum()) {
+        presetIndex = 0;
+        tourDone = true;
+    }
+    return 0;
+}
+
+// Consumes the request before showing idle, for the reason given in
+// ChangeExcutePatrol.
+void PatrolExecutor::ExecFinish(int patrolId) {
+    ClearPatrolData(patrolId, execType);
+    execType = PATROL_EXEC_NONE;
+    status = PATROL_STATUS_IDLE;
+}
