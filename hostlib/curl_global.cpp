@@ -1,0 +1,10 @@
+#include "hostlib/curl_global.h"
+
+#include <curl/curl.h>
+
+#include <mutex>
+
+void HostCurlGlobalInit() {
+    static std::once_flag once;
+    std::call_once(once, [] { curl_global_init(CURL_GLOBAL_DEFAULT); });
+}
