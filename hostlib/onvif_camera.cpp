@@ -13,6 +13,7 @@
 #include <mutex>
 #include <vector>
 
+#include "hostlib/curl_global.h"
 #include "hostlib/onvif_soap.h"
 
 namespace onvif {
@@ -53,8 +54,7 @@ std::map<std::string, std::shared_ptr<CameraEntry>>& Cameras() {
 }
 
 std::shared_ptr<CameraEntry> EntryFor(const std::string& key) {
-    static std::once_flag once;
-    std::call_once(once, [] { curl_global_init(CURL_GLOBAL_DEFAULT); });
+    HostCurlGlobalInit();
     std::lock_guard<std::mutex> lock(gCamerasMu);
     auto& e = Cameras()[key];
     if (!e) e = std::make_shared<CameraEntry>();
