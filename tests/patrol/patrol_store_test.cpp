@@ -94,6 +94,21 @@ protected:
     }
 };
 
+TEST_F(PatrolStore, PresetListIndexesAndRefusesBadOnesWithoutWriting) {
+    Patrol p;
+    EXPECT_EQ(p.AddPresetToList(Preset(3, "door")), 0);
+    EXPECT_EQ(p.AddPresetToList(Preset(8, "yard")), 1);
+    PRESET_INFO out = Preset(-1, "untouched");
+    for (int bad : {2, -1}) EXPECT_EQ(p.GetPresetFromList(bad, &out), -1);
+    EXPECT_EQ(p.GetPresetFromList(0, nullptr), -1);
+    EXPECT_EQ(out.name, "untouched");
+    EXPECT_EQ(p.GetPresetFromList(1, &out), 0);
+    EXPECT_EQ(out.position, 8);
+    EXPECT_EQ(out.name, "yard");
+    Patrol never(-4);  // ids below 1 are not loaded
+    EXPECT_THAT(fake::Statements(), IsEmpty());
+}
+
 TEST_F(PatrolStore, LoadReadsRowThenPresetsThenAsksTheCamera) {
     StorePatrol({2, 1});
     Patrol p;
@@ -132,13 +147,6 @@ TEST_F(PatrolStore, LoadRefusesBadIdsAndLeavesTheObjectOnFailures) {
     EXPECT_EQ(fake::NullResultsFreed(), 0);  // no result to release after a failed query
 }
 
-TEST_F(PatrolStore, LoadingConstructorLoadsOnlyPositiveIds) {
-    StorePatrol({1});
-    Patrol loaded(12);
-    EXPECT_EQ(loaded.GetName(), "gate");
-    EXPECT_EQ(loaded.GetPresetListNum(), 1);
-}
-
 TEST_F(PatrolStore, PresetFieldsConvertLikeStrtolAndNullsReadAsZeroOrEmpty) {
     fake::OnSql(PatrolSelect(12), {0, {{{"id", "12"}, {"camId", std::nullopt}, {"name", std::nullopt},
                                         {"stayTime", " -3x"}}}});
@@ -156,12 +164,6 @@ TEST_F(PatrolStore, PresetFieldsConvertLikeStrtolAndNullsReadAsZeroOrEmpty) {
     EXPECT_EQ(a.name, "zero");
     EXPECT_EQ(b.position, 7);
     EXPECT_EQ(b.name, "");
-}
-
-TEST_F(PatrolStore, PutRowRefusesNullResult) {
-    Patrol p;
-    EXPECT_EQ(p.PutRowIntoClassPatrol(nullptr, 0), -2);
-    EXPECT_THAT(Messages(), ElementsAre("PutRowIntoClassPatrol(): Invalid function parameter"));
 }
 
 TEST_F(PatrolStore, SaveInsertsTakesTheNewIdThenRewritesPresets) {
