@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <string>
 
+#include "common/camera_control.h"
 #include "host/camera.h"
 
 #define EXECUTOR_LOG(fmt, ...)                                                              \
@@ -276,17 +277,7 @@ int PatrolExecutor::ExecPatrol(Patrol& patrol, int& presetIndex, bool& tourDone)
         EXECUTOR_LOG("Get camera info. [%d] failed.", patrol.GetCamId());
         return -1;
     }
-    CameraAPI* api = nullptr;
-    {
-        const std::string host = camera.GetHost();
-        const int port = camera.GetPort();
-        const std::string username = camera.GetUsername();
-        const std::string password = camera.GetPassword();
-        const std::string vendor = camera.GetVendor();
-        const std::string model = camera.GetModel();
-        const std::string channel = camera.GetCH();
-        api = newCameraAPI(host, port, username, password, vendor, model, channel);
-    }
+    CameraAPI* api = NewCameraAPIFromRecord(camera);
     if (api == nullptr) {
         EXECUTOR_LOG("Get camera API failed.");
         return -1;

@@ -10,6 +10,7 @@
 #include <memory>
 #include <new>
 
+#include "common/camera_control.h"
 #include "host/camera.h"
 
 #define PATROL_LOG(fmt, ...) \
@@ -312,17 +313,7 @@ int Patrol::UpdatePresetInfo() {
         PATROL_LOG("Get camera info. [%d] failed.", camId);
         return -1;
     }
-    CameraAPI* api = nullptr;
-    {
-        const std::string host = camera.GetHost();
-        const int port = camera.GetPort();
-        const std::string username = camera.GetUsername();
-        const std::string password = camera.GetPassword();
-        const std::string vendor = camera.GetVendor();
-        const std::string model = camera.GetModel();
-        const std::string channel = camera.GetCH();
-        api = newCameraAPI(host, port, username, password, vendor, model, channel);
-    }
+    CameraAPI* api = NewCameraAPIFromRecord(camera);
     if (api == nullptr) {
         PATROL_LOG("Get camera API failed.");
         return -1;

@@ -12,6 +12,7 @@
 #include <cstdio>
 #include <cstring>
 
+#include "common/camera_control.h"
 #include "snapshot/snapshot.h"
 
 namespace {
@@ -69,9 +70,7 @@ int ReplaceFile(const char* path, const unsigned char* data, int size) {
 }
 
 int SnapshotFileWrite(const char* path, Camera* camera) {
-    CameraAPI* api = newCameraAPI(camera->GetHost(), camera->GetPort(), camera->GetUsername(),
-                                  camera->GetPassword(), camera->GetVendor(), camera->GetModel(),
-                                  camera->GetCH());
+    CameraAPI* api = NewCameraAPIFromRecord(*camera);
     if (api == nullptr) {
         api = newUserDefinedAPI(camera->GetHost(), camera->GetPort(), camera->GetUsername(),
                                 camera->GetPassword(), camera->GetPath(), "1");
