@@ -1,20 +1,15 @@
-// Servers for the snapshot integration tests and benchmarks, all on
-// 127.0.0.1 and started in the foreground with our own config files in a
-// scratch directory: nginx (a JPEG with Content-Length, Basic auth under
-// /auth/), lighttpd (the JPEG through a CGI: chunked, Digest auth under
-// /cgi-bin/auth.cgi), ffmpeg's mpjpeg muxer (one multipart client), and a
-// scripted raw server for transport faults. Each stops its process by pid.
+// Third-party servers for the snapshot integration tests and benchmarks, on
+// 127.0.0.1, started in the foreground with our own config files in a scratch
+// directory and stopped by pid: nginx (Content-Length, Basic auth under
+// /auth/), lighttpd (a CGI: chunked, Digest auth on /cgi-bin/auth.cgi) and
+// ffmpeg's mpjpeg muxer (one multipart client).
 #ifndef TESTS_SNAPSHOT_LOCAL_SERVERS_H
 #define TESTS_SNAPSHOT_LOCAL_SERVERS_H
 
 #include <sys/types.h>
 
-#include <atomic>
-#include <chrono>
-#include <functional>
 #include <memory>
 #include <string>
-#include <thread>
 #include <vector>
 
 namespace testsrv {
@@ -34,91 +29,44 @@ private:
     std::string path_;
 };
 
-// A port on 127.0.0.1 that was free a moment ago.
-int FreePort();
-// Polls until something accepts connections on 127.0.0.1:port.
-bool WaitForPort(int port, std::chrono::milliseconds timeout);
-
-// A child process; SIGTERM then, after 5 s, SIGKILL to its pid on destruction.
-class Process {
+// A child process given its config; SIGTERM (then SIGKILL) to its pid on destruction.
+class Server {
 public:
-    explicit Process(const std::vector<std::string>& argv);
-    ~Process();
-    pid_t Pid() const { return pid_; }
-    bool Running();
+    ~Server() { Stop(); }
+    int Port() const { return port_; }
+    bool Ok() const { return ok_; }
+    const std::string& Dir() const { return dir_.Path(); }
 
-private:
+protected:
+    // Writes `conf(dir, port)` (if any) to `confName` and runs `argv`, retrying on another
+    // port (when port_ was 0); `probe`: waits until the port accepts connections.
+    void Start(const std::string& confName, std::string (*conf)(const std::string& dir, int port),
+               const std::vector<std::string>& argv, bool probe = true);
+    void Stop();
+    TempDir dir_;
+    int port_ = 0;
+    bool ok_ = false;
     pid_t pid_ = -1;
 };
 
-class Nginx {
+// `files` (name -> bytes) at /<name> and /auth/<name> (Basic admin:secret); /moved.jpg redirects.
+class Nginx : public Server {
 public:
-    // Serves `files` (name -> bytes) at /<name> and at /auth/<name> (Basic auth
-    // admin:secret); /moved.jpg redirects to /snap.jpg.
     explicit Nginx(const std::vector<std::pair<std::string, std::string>>& files);
-    int Port() const { return port_; }
-    bool Ok() const { return ok_; }
-
-private:
-    TempDir dir_;
-    int port_ = 0;
-    bool ok_ = false;
-    std::unique_ptr<Process> process_;
 };
 
-class Lighttpd {
+// `image` through /cgi-bin/snap.cgi (chunked) and /cgi-bin/auth.cgi (Digest admin:secret).
+class Lighttpd : public Server {
 public:
-    // Serves `image` through /cgi-bin/snap.cgi (chunked) and /cgi-bin/auth.cgi
-    // (the same behind Digest auth admin:secret).
     explicit Lighttpd(const std::string& image);
-    int Port() const { return port_; }
-    bool Ok() const { return ok_; }
-
-private:
-    TempDir dir_;
-    int port_ = 0;
-    bool ok_ = false;
-    std::unique_ptr<Process> process_;
 };
 
-// ffmpeg's mpjpeg muxer serving a test pattern at /stream.mjpeg to one
-// client; it stops after `seconds` of stream. Not probed (a probe would be its
-// one client): callers retry a refused connection.
-class FfmpegMjpeg {
+// A test pattern at /stream.mjpeg for `seconds` to one client; not probed (the
+// probe would be its one client): callers retry a refused connection.
+class FfmpegMjpeg : public Server {
 public:
     explicit FfmpegMjpeg(int seconds = 20);
-    int Port() const { return port_; }
     std::string Path() const { return "/stream.mjpeg"; }
-
-private:
-    int port_ = 0;
-    std::unique_ptr<Process> process_;
-};
-
-// A raw TCP server: each connection's request head is read, then `reply`
-// writes whatever it likes on the socket. `Stopping()` tells a reply that
-// stalls when to give up.
-class ScriptServer {
-public:
-    using Reply = std::function<void(int fd, const std::string& request, ScriptServer& server)>;
-    explicit ScriptServer(Reply reply);
-    ~ScriptServer();
-    int Port() const { return port_; }
-    bool Stopping() const { return stop_; }
-    int Connections() const { return connections_; }
-    // Writes all of `bytes`; false when the peer went away.
-    static bool Send(int fd, const std::string& bytes);
-    // Waits until the peer closes or the server stops (at most `limit`).
-    void Hold(int fd, std::chrono::milliseconds limit);
-
-private:
-    void Run();
-    Reply reply_;
-    int listenFd_ = -1;
-    int port_ = 0;
-    std::atomic<bool> stop_{false};
-    std::atomic<int> connections_{0};
-    std::thread thread_;
 };
 
 }  // namespace testsrv
