@@ -1,0 +1,303 @@
+// The executors against the fake host with the real timers: PatrolExecutor
+// precedence, failures, stay times and shutdown; GuardExecutor decisions,
+// repeats, pauses, hold-off and shutdown; the pacing timer.
+#include <gtest/gtest.h>
+#include <sys/time.h>
+
+#include <algorithm>
+#include <atomic>
+#include <memory>
+#include <thread>
+#include <tuple>
+
+#include "executor/guardExecutor.h"
+#include "executor/patrolExecutor.h"
+#include "fake/fake_host.h"
+#include "host/timer.h"
+
+// Lets a test judge entries with no guard thread to take the command.
+struct GuardExecutorPeer {
+    static void PrepareWithoutThread(GuardExecutor& g) {
+        pthread_mutex_init(&g.mutex, nullptr);
+        pthread_cond_init(&g.wake, nullptr);
+        g.started = true;
+    }
+    static void StartThread(GuardExecutor& g) {
+        pthread_create(&g.thread, nullptr, GuardExecutor::ThreadFuncExcute, &g);
+    }
+    static void Set(GuardExecutor& g, int state, int eventValidSeconds) {
+        g.state = state;
+        g.eventValidSeconds = eventValidSeconds;
+        g.current = {5, GUARD_MODE_CONTINUOUS};
+    }
+    static std::pair<int, int> Take(GuardExecutor& g) {  // command and pending id; clears
+        pthread_mutex_lock(&g.mutex);
+        const std::pair<int, int> taken{g.command, g.pending.patrolId};
+        g.command = GUARD_CMD_NONE;
+        pthread_mutex_unlock(&g.mutex);
+        return taken;
+    }
+    static int State(GuardExecutor& g) { return g.state.load(); }
+};
+
+namespace {
+
+using Peer = GuardExecutorPeer;
+using namespace std::chrono_literals;
+using Clock = std::chrono::steady_clock;
+
+constexpr auto kPass = 250ms;
+constexpr auto kSlack = 400ms;  // scheduling on a loaded machine and sanitizers
+
+// Scripts the two SELECTs of Patrol::Load and gives camera `camId` the
+// positions. Call before any executor thread can reach the camera.
+void StorePatrol(int id, int camId, int stayTime, const std::vector<int>& positions) {
+    const auto str = [](int v) { return std::to_string(v); };
+    const std::string ids = str(id), host = "cam" + str(camId);
+    fake::Row row{{"id", ids}, {"camId", str(camId)}, {"name", "t"}, {"stayTime", str(stayTime)}};
+    fake::OnSql("SELECT * FROM patrol WHERE id = " + ids + ";", {0, {row}});
+    fake::FakeCamera camera;
+    camera.settings.id = camId;
+    camera.settings.host = host;
+    fake::AddCamera(camera);
+    fake::Answer presets;
+    for (int p : positions) {
+        presets.rows.push_back({{"position", str(p)}, {"name", "P" + str(p)}});
+        fake::CameraHost(host).presets[p] = "P" + str(p);
+    }
+    fake::OnSql("FROM patrol_preset WHERE patrolId = " + ids + " ORDER BY", presets);
+}
+
+// "5 kelo5" for each position.
+std::vector<std::string> MovesTo(const std::vector<int>& positions) {
+    std::vector<std::string> out;
+    for (int p : positions) out.push_back(std::to_string(p) + " kelo" + std::to_string(p));
+    return out;
+}
+
+bool WaitForMoves(size_t count, std::chrono::milliseconds timeout = 3000ms) {
+    return fake::WaitFor([count] { return fake::Moves().size() >= count; }, timeout);
+}
+
+// How often patrol `id` was loaded (its row read).
+int Loads(int id) {
+    const auto s = fake::Statements();
+    const std::string row = "SELECT * FROM patrol WHERE id = " + std::to_string(id) + ";";
+    return static_cast<int>(std::count(s.begin(), s.end(), row));
+}
+
+double Since(Clock::time_point t) {
+    return std::chrono::duration<double>(Clock::now() - t).count();
+}
+
+// Whether "patrolExecutor.cpp:<line>:<function>(): <message>" was logged.
+bool Logged(const std::string& what) {
+    for (const auto& t : fake::LogTexts()) {
+        if (t.rfind("patrolExecutor.cpp:", 0) == 0 && t.find(what) != t.npos) return true;
+    }
+    return false;
+}
+
+class ExecutorTest : public ::testing::Test {
+protected:
+    void SetUp() override { fake::Reset(); }
+    bool WaitForStatus(int status, std::chrono::milliseconds timeout = kPass + kSlack) {
+        return fake::WaitFor([&] { return executor.GetStatus() == status; }, timeout);
+    }
+    bool WaitForState(int state, std::chrono::milliseconds timeout = kPass + kSlack) {
+        return fake::WaitFor([&] { return Peer::State(guard) == state; }, timeout);
+    }
+    void Judge(int patrolId, int mode) { guard.AnalyzeSchedule({}, {}, {patrolId, mode}); }
+    // The fake saw exactly `moves`, and nothing more arrives within two passes.
+    static void ExpectMovesSettle(const std::vector<int>& moves) {
+        ASSERT_TRUE(WaitForMoves(moves.size()));
+        std::this_thread::sleep_for(2 * kPass);
+        EXPECT_EQ(fake::Moves(), MovesTo(moves));
+    }
+    PatrolExecutor executor;  // idle until a request
+    GuardExecutor guard{1};   // no thread until Init
+};
+
+TEST_F(ExecutorTest, PrecedenceOfDirectAndGuardRequestsAndRemovals) {
+    StorePatrol(20, 1, 1, {1, 2, 3});
+    StorePatrol(21, 1, 0, {7, 8});
+    executor.Execute(20, PATROL_EXEC_GUARD);
+    ASSERT_TRUE(WaitForMoves(1));
+    executor.Execute(20, PATROL_EXEC_GUARD);  // the same request again: run undisturbed
+    ASSERT_TRUE(WaitForMoves(2));
+    executor.Execute(21, PATROL_EXEC_DIRECT);  // displaces the guard run, which restarts
+    ASSERT_TRUE(WaitForMoves(6));
+    EXPECT_EQ(fake::Moves(), MovesTo({1, 2, 7, 8, 7, 1}));
+    executor.RemovePatrol(PATROL_EXEC_DIRECT);  // not running: only its slot emptied
+    ASSERT_TRUE(WaitForMoves(7));
+    executor.RemovePatrol(PATROL_EXEC_GUARD);  // running: idle at the next pass
+    ASSERT_TRUE(WaitForStatus(PATROL_STATUS_IDLE));
+    ExpectMovesSettle({1, 2, 7, 8, 7, 1, 2});
+    executor.Execute(20, PATROL_EXEC_DIRECT);
+    ASSERT_TRUE(WaitForMoves(8));
+    executor.Execute(21, PATROL_EXEC_GUARD);  // waits behind the direct run
+    ExpectMovesSettle({1, 2, 7, 8, 7, 1, 2, 1});
+}
+
+TEST_F(ExecutorTest, ZeroAndNegativeIdsAndStayTimes) {
+    StorePatrol(60, 1, 1, {1, 2, 3});
+    StorePatrol(11, 1, -5, {4, 5});    // no stay
+    StorePatrol(12, 1, 4295, {6, 7});  // 4295 s does not fit 32 bits in microseconds
+    executor.Execute(60, PATROL_EXEC_GUARD);
+    ASSERT_TRUE(WaitForMoves(1));
+    executor.Execute(0, PATROL_EXEC_GUARD);  // the running kind, other slot empty: stops
+    ASSERT_TRUE(WaitForStatus(PATROL_STATUS_IDLE));
+    executor.Execute(60, PATROL_EXEC_GUARD);
+    ASSERT_TRUE(WaitForMoves(2));
+    executor.Execute(-3, PATROL_EXEC_DIRECT);  // picked, dropped, stops the guard run
+    ASSERT_TRUE(WaitForStatus(PATROL_STATUS_IDLE));
+    ExpectMovesSettle({1, 1});
+    EXPECT_TRUE(fake::LogTexts().empty());
+    executor.RemovePatrol(PATROL_EXEC_GUARD);  // the guard request was still waiting
+    executor.Execute(11, PATROL_EXEC_DIRECT);
+    ASSERT_TRUE(WaitForMoves(5, 2 * kPass + kSlack));
+    executor.Execute(12, PATROL_EXEC_DIRECT);
+    ExpectMovesSettle({1, 1, 4, 5, 4, 6});
+    EXPECT_EQ(executor.GetStatus(), PATROL_STATUS_RUNNING);
+}
+
+TEST_F(ExecutorTest, RefusedPresetNoPresetsAndLoadFailures) {
+    StorePatrol(100, 2, 0, {5, 2, 9});
+    fake::CameraHost("cam2").refusedPositions = {2};
+    StorePatrol(71, 1, 0, {});
+    StorePatrol(80, 1, 1, {1, 2, 3});
+    executor.Execute(100, PATROL_EXEC_GUARD);  // the camera refuses the second preset
+    ASSERT_TRUE(WaitForMoves(2));
+    ASSERT_TRUE(WaitForStatus(PATROL_STATUS_IDLE));
+    EXPECT_TRUE(Logged("ExecPatrol(): Go to camera preset failed. Position=2, Name=kelo2"));
+    executor.Execute(71, PATROL_EXEC_DIRECT);
+    ASSERT_TRUE(fake::WaitFor([] { return Logged("ExecPatrol(): No preset to execute."); }, 1s));
+    executor.Execute(42, PATROL_EXEC_GUARD);
+    ASSERT_TRUE(fake::WaitFor([] { return Logged("(): Load patrol 42 failure."); }, 1s));
+    EXPECT_EQ(executor.GetStatus(), PATROL_STATUS_IDLE);
+    // A direct request fails to load while the guard slot names the
+    // interrupted guard run: that run starts again, not left loading.
+    executor.Execute(80, PATROL_EXEC_GUARD);
+    ASSERT_TRUE(WaitForMoves(4));
+    executor.Execute(99, PATROL_EXEC_DIRECT);
+    ASSERT_TRUE(WaitForMoves(5));
+    EXPECT_TRUE(Logged("ChangeExcutePatrol(): Load patrol 99 failure."));
+    EXPECT_EQ(fake::Moves(), MovesTo({5, 2, 1, 2, 1}));
+    EXPECT_EQ(executor.GetStatus(), PATROL_STATUS_RUNNING);
+    EXPECT_EQ(fake::ResultsOutstanding(), 0);
+}
+
+TEST_F(ExecutorTest, DestructionDuringARunMakesNoFurtherMove) {
+    StorePatrol(110, 1, 0, {1, 2, 3});
+    std::atomic<int> entered{0};
+    fake::OnGoPreset([&](int, const std::string&) {
+        if (++entered == 2) std::this_thread::sleep_for(300ms);  // a slow camera call
+    });
+    auto own = std::make_unique<PatrolExecutor>();
+    own->Execute(110, PATROL_EXEC_DIRECT);
+    ASSERT_TRUE(fake::WaitFor([&] { return entered.load() == 2; }, 2000ms));
+    own.reset();  // while the second move is under way
+    EXPECT_EQ(fake::Moves(), MovesTo({1, 2}));
+    EXPECT_EQ(fake::ApisOutstanding(), 0);
+}
+
+TEST(DelayTimer, PassesKeepToTheirGridWithoutDrift) {
+    DelayTimer pacer(50000);
+    const auto start = Clock::now();
+    pacer.BeginTiming();
+    for (int pass = 0; pass < 10; ++pass) {
+        std::this_thread::sleep_for(30ms);  // the work of a pass
+        pacer.Delay();
+    }
+    EXPECT_GE(Since(start), 0.5 - 0.005);  // ten periods, not ten periods plus the work
+    EXPECT_LT(Since(start), 0.5 + 0.2);
+}
+
+// An event status `ageSeconds` old (negative: in the future).
+EVENT_STATUS Event(unsigned char active, double ageSeconds) {
+    struct timeval now;
+    gettimeofday(&now, nullptr);
+    const long long us =
+        now.tv_sec * 1000000LL + now.tv_usec - static_cast<long long>(ageSeconds * 1e6);
+    return {active, 0, {static_cast<time_t>(us / 1000000), static_cast<suseconds_t>(us % 1000000)}};
+}
+
+TEST_F(ExecutorTest, InitWithNullThenDecisionTableThenAnUntakenStartIsKept) {
+    EXPECT_EQ(guard.Init(nullptr, 1, 1, 10), -2);
+    EXPECT_EQ(guard.Terminate(), -1);
+    Judge(5, GUARD_MODE_CONTINUOUS);  // ignored
+    enum { OFF, CONT, FIRST, SECOND, ANY };
+    enum { IDLE, RUNNING, INTERVAL, HOLDOFF };
+    enum { NONE, START, STOP };
+    const EVENT_STATUS on = Event(1, 0.5), off = Event(0, 0.5), expired = Event(1, 20);
+    const EVENT_STATUS ahead = Event(1, -5), skewed = Event(1, -0.5);  // tolerance: 1 s
+    // state, event validity in seconds, first and second event, entry mode and patrol, decision
+    const std::tuple<int, int, EVENT_STATUS, EVENT_STATUS, int, int, int> cases[] = {
+        // clang-format off
+        {IDLE, 10, off, off, CONT, 5, START},      {IDLE, 10, on, on, OFF, 5, NONE},
+        {IDLE, 10, on, off, FIRST, 5, START},      {IDLE, 10, off, on, FIRST, 5, NONE},
+        {IDLE, 10, expired, off, FIRST, 5, NONE},  {IDLE, 10, ahead, off, FIRST, 5, NONE},
+        {IDLE, 10, skewed, off, FIRST, 5, START},  {IDLE, 10, off, on, SECOND, 5, START},
+        {IDLE, 10, on, off, SECOND, 5, NONE},      {IDLE, 10, off, expired, SECOND, 5, NONE},
+        {IDLE, 10, off, on, ANY, 5, START},        {IDLE, 10, off, off, ANY, 5, NONE},
+        {IDLE, 10, expired, expired, ANY, 5, NONE}, {RUNNING, 10, off, off, CONT, 5, NONE},
+        {RUNNING, 10, off, off, CONT, 6, STOP},    {INTERVAL, 10, on, off, FIRST, 5, STOP},
+        {INTERVAL, 10, off, off, OFF, 5, STOP},    {HOLDOFF, 10, on, on, ANY, 6, NONE},
+        {IDLE, -1, on, off, FIRST, 5, NONE},       // a negative validity counts as 0
+        {IDLE, 3000, Event(1, 100), off, FIRST, 5, START},  // span saturates, not negative
+        // clang-format on
+    };
+    Peer::PrepareWithoutThread(guard);
+    for (const auto& [state, validity, first, second, mode, patrolId, expected] : cases) {
+        Peer::Set(guard, state, validity);
+        guard.AnalyzeSchedule(first, second, {patrolId, mode});
+        EXPECT_EQ(Peer::Take(guard).first, expected) << "mode " << mode << ", state " << state;
+    }
+    // A START not yet taken is not replaced by a STOP; pending follows the newest entry.
+    Peer::Set(guard, IDLE, 10);
+    Judge(201, CONT);
+    Peer::Set(guard, INTERVAL, 10);
+    Judge(202, CONT);  // would post a STOP
+    EXPECT_EQ(Peer::Take(guard), std::make_pair(static_cast<int>(START), 202));
+    Peer::StartThread(guard);  // for Terminate
+    EXPECT_EQ(guard.Terminate(), 0);
+}
+
+// repeatCount 2: two runs back to back, a pause, off while pausing, the 5 s
+// hold-off, a start again; then Terminate during a run.
+TEST_F(ExecutorTest, ContinuousRunsTwicePausesHoldsOffAndTerminates) {
+    StorePatrol(210, 1, 1, {3});
+    ASSERT_EQ(guard.Init(&executor, 2, 1, 10), 0);
+    Judge(210, GUARD_MODE_CONTINUOUS);
+    ASSERT_TRUE(fake::WaitFor([] { return Loads(210) == 2; }, 2000ms + kPass + kSlack));
+    ASSERT_TRUE(WaitForState(GUARD_STATE_INTERVAL, 3000ms));
+    Judge(210, GUARD_MODE_CONTINUOUS);  // pausing: starts nothing
+    Judge(210, GUARD_MODE_OFF);
+    ASSERT_TRUE(WaitForState(GUARD_STATE_HOLDOFF));
+    const auto holdoff = Clock::now();
+    ASSERT_TRUE(WaitForState(GUARD_STATE_IDLE, 5000ms + kPass + kSlack));
+    EXPECT_GE(Since(holdoff), 5.0 - 0.25);
+    EXPECT_EQ(Loads(210), 2);
+    Judge(210, GUARD_MODE_CONTINUOUS);
+    ASSERT_TRUE(WaitForMoves(5));
+    const auto asked = Clock::now();
+    EXPECT_EQ(guard.Terminate(), 0);
+    EXPECT_LE(Since(asked), 0.25 + 0.4);  // a pass and the slack
+    ASSERT_TRUE(WaitForMoves(6));         // the executor's tour goes on to its end
+    EXPECT_EQ(fake::Moves(), MovesTo({3, 3, 3, 3, 3, 3}));
+}
+
+// repeatCount 0 repeats until a new entry stops it (hold-off, no more runs).
+TEST_F(ExecutorTest, RepeatsWithoutEndUntilANewEntryStopsIt) {
+    StorePatrol(250, 1, 0, {1});
+    ASSERT_EQ(guard.Init(&executor, 0, 1, 10), 0);
+    Judge(250, GUARD_MODE_CONTINUOUS);
+    ASSERT_TRUE(fake::WaitFor([] { return Loads(250) == 3; }, 5000ms));
+    Judge(251, GUARD_MODE_CONTINUOUS);
+    ASSERT_TRUE(WaitForState(GUARD_STATE_HOLDOFF));
+    std::this_thread::sleep_for(1500ms);  // longer than one run and the wait after it
+    EXPECT_EQ(Loads(250), 3);
+    EXPECT_EQ(executor.GetStatus(), PATROL_STATUS_IDLE);
+}
+
+}  // namespace
