@@ -81,11 +81,13 @@ std::string Url(const std::string& path) {
 
 void BM_SnapshotGet_2MiB(benchmark::State& state) {
     if (!S().ok) return state.SkipWithError("nginx did not start");
-    StaticApi api("/snap.jpg", 1);
+    // The user-defined camera serves a fixed location, as a camera without ONVIF would.
+    std::unique_ptr<CameraAPI, void (*)(CameraAPI*)> api(
+        newUserDefinedAPI("127.0.0.1", S().nginx->Port(), "", "", "/snap.jpg", "1"), releaseCameraAPI);
     for (auto _ : state) {
         unsigned char* buffer = nullptr;
         int size = 0;
-        if (SnapshotGet("127.0.0.1", S().nginx->Port(), "", "", api, "", &buffer, &size) != 0 ||
+        if (SnapshotGet("127.0.0.1", S().nginx->Port(), "", "", *api, "", &buffer, &size) != 0 ||
             size != static_cast<int>(kImageBytes))
             state.SkipWithError("fetch failed");
         benchmark::DoNotOptimize(buffer);
@@ -121,11 +123,13 @@ void BM_CurlEasyPerform_2MiB(benchmark::State& state) {
 
 void BM_SnapshotGet_MjpegFirstFrame(benchmark::State& state) {
     if (!S().ok) return state.SkipWithError("nginx did not start");
-    StaticApi api("/stream.mjpeg", 2);
+    // The user-defined camera serves a fixed location, as a camera without ONVIF would.
+    std::unique_ptr<CameraAPI, void (*)(CameraAPI*)> api(
+        newUserDefinedAPI("127.0.0.1", S().nginx->Port(), "", "", "/stream.mjpeg", "2"), releaseCameraAPI);
     for (auto _ : state) {
         unsigned char* buffer = nullptr;
         int size = 0;
-        if (SnapshotGet("127.0.0.1", S().nginx->Port(), "", "", api, "", &buffer, &size) != 0)
+        if (SnapshotGet("127.0.0.1", S().nginx->Port(), "", "", *api, "", &buffer, &size) != 0)
             state.SkipWithError("fetch failed");
         SnapshotFree(buffer);
     }
