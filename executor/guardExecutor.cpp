@@ -7,6 +7,7 @@
 #include <climits>
 #include <cstdint>
 
+#include "common/worker_thread.h"
 #include "host/timer.h"
 
 #define GUARD_LOG(fmt, ...) \
@@ -52,7 +53,7 @@ int GuardExecutor::Init(PatrolExecutor* executor, int repeatCount, int pauseMinu
     pthread_mutex_init(&mutex, nullptr);
     pthread_cond_init(&wake, nullptr);
     started = true;
-    const int rc = pthread_create(&thread, nullptr, ThreadFuncExcute, this);
+    const int rc = StartWorkerThread(&thread, ThreadFuncExcute, this);
     if (rc != 0) {
         // Without a thread there is nothing to terminate: report the failure.
         GUARD_LOG("Create guard thread failed: %d.", rc);

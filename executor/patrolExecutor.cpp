@@ -8,6 +8,7 @@
 #include <string>
 
 #include "common/camera_control.h"
+#include "common/worker_thread.h"
 #include "host/camera.h"
 
 #define EXECUTOR_LOG(fmt, ...)                                                              \
@@ -34,7 +35,7 @@ PatrolExecutor::PatrolExecutor()
       threadStarted(false) {
     pthread_mutex_init(&mutex, nullptr);
     pthread_cond_init(&wake, nullptr);
-    const int rc = pthread_create(&thread, nullptr, ThreadFuncExcute, this);
+    const int rc = StartWorkerThread(&thread, ThreadFuncExcute, this);
     threadStarted = (rc == 0);
     if (!threadStarted) EXECUTOR_LOG("Create worker thread failed: %d.", rc);
 }

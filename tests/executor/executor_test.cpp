@@ -2,6 +2,7 @@
 // precedence, failures, stay times and shutdown; GuardExecutor decisions,
 // repeats, pauses, hold-off and shutdown; the pacing timer.
 #include <gtest/gtest.h>
+#include <pthread.h>
 #include <sys/time.h>
 
 #include <algorithm>
@@ -190,7 +191,15 @@ TEST_F(ExecutorTest, RefusedPresetNoPresetsAndLoadFailures) {
 TEST_F(ExecutorTest, DestructionDuringARunMakesNoFurtherMove) {
     StorePatrol(110, 1, 0, {1, 2, 3});
     std::atomic<int> entered{0};
+    std::atomic<size_t> stack{0};
     fake::OnGoPreset([&](int, const std::string&) {
+        pthread_attr_t attr;  // the worker's own stack: bounded, whatever the ulimit
+        size_t size = 0;
+        if (pthread_getattr_np(pthread_self(), &attr) == 0) {
+            pthread_attr_getstacksize(&attr, &size);
+            pthread_attr_destroy(&attr);
+        }
+        stack = size;
         if (++entered == 2) std::this_thread::sleep_for(300ms);  // a slow camera call
     });
     auto own = std::make_unique<PatrolExecutor>();
@@ -199,6 +208,8 @@ TEST_F(ExecutorTest, DestructionDuringARunMakesNoFurtherMove) {
     own.reset();  // while the second move is under way
     EXPECT_EQ(fake::Moves(), MovesTo({1, 2}));
     EXPECT_EQ(fake::ApisOutstanding(), 0);
+    EXPECT_GT(stack.load(), 0u);
+    EXPECT_LE(stack.load(), 1024u * 1024u);
 }
 
 TEST(DelayTimer, PassesKeepToTheirGridWithoutDrift) {
