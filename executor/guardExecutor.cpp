@@ -222,19 +222,7 @@ int GuardExecutor::ExcuteMain() {
                 break;
         }
 
-        // Idle with no command: the passes would do nothing, so sleep until
-        // a command is posted and act on it at once, on a new grid.
-        bool waited = false;
-        pthread_mutex_lock(&mutex);
-        while (command == GUARD_CMD_NONE && state.load() == GUARD_STATE_IDLE) {
-            pthread_cond_wait(&wake, &mutex);
-            waited = true;
-        }
-        pthread_mutex_unlock(&mutex);
-        if (waited) {
-            pacer.BeginTiming();
-        } else {
-            pacer.Delay();
-        }
+        EndWorkerPass(&mutex, &wake, pacer,
+                      [this] { return command == GUARD_CMD_NONE && state.load() == GUARD_STATE_IDLE; });
     }
 }

@@ -229,20 +229,8 @@ int PatrolExecutor::ExcuteMain() {
                 break;
         }
 
-        // Idle with no command: the passes would do nothing, so sleep until
-        // a command is posted and act on it at once, on a new grid.
-        bool waited = false;
-        pthread_mutex_lock(&mutex);
-        while (command == PATROL_CMD_NONE && status.load() == PATROL_STATUS_IDLE) {
-            pthread_cond_wait(&wake, &mutex);
-            waited = true;
-        }
-        pthread_mutex_unlock(&mutex);
-        if (waited) {
-            pacer.BeginTiming();
-        } else {
-            pacer.Delay();
-        }
+        EndWorkerPass(&mutex, &wake, pacer,
+                      [this] { return command == PATROL_CMD_NONE && status.load() == PATROL_STATUS_IDLE; });
     }
 }
 
