@@ -76,7 +76,7 @@ CameraAPI* newUserDefinedAPI(const std::string& host, int port, const std::strin
 void releaseCameraAPI(CameraAPI* api);
 
 // Connection status of a camera. Only 1 and 5 let the library read presets.
-// The host sets statuses through hostlib/camera_status.h; a camera whose
+// The host sets statuses through hostlib/db/camera_status.h; a camera whose
 // status was never set reports 1. Thread-safe.
 int GetCamConnStatus(int camId);
 

@@ -15,7 +15,7 @@ set -euo pipefail
 cmd=${1:?usage: pg_cluster.sh start|restart|down|up|stop DIR}
 dir=${2:?usage: pg_cluster.sh start|restart|down|up|stop DIR}
 here=$(cd "$(dirname "$0")" && pwd)
-schema="$here/../hostlib/schema.sql"
+schema="$here/../hostlib/db/schema.sql"
 
 bindir=$(ls -d /usr/lib/postgresql/*/bin 2>/dev/null | sort -V | tail -n 1)
 [ -x "$bindir/initdb" ] || { echo "pg_cluster: PostgreSQL server binaries not found" >&2; exit 1; }

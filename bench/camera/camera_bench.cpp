@@ -19,7 +19,7 @@
 
 #include "bench/ratio_reporter.h"
 #include "host/camera.h"
-#include "hostlib/onvif_soap.h"
+#include "hostlib/camera/onvif_soap.h"
 #include "support/camsim.h"
 
 namespace {

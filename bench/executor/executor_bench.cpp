@@ -32,7 +32,7 @@
 #include "executor/patrolExecutor.h"
 #include "host/camera.h"
 #include "host/database.h"
-#include "hostlib/onvif_camera.h"
+#include "hostlib/camera/onvif_camera.h"
 #include "patrol/patrol.h"
 #include "support/camsim.h"
 

@@ -11,7 +11,7 @@
 #include <string>
 #include <vector>
 
-#include "hostlib/camera_status.h"
+#include "hostlib/db/camera_status.h"
 #include "patrol/patrol.h"
 #include "ratio_reporter.h"
 

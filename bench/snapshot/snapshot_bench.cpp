@@ -16,7 +16,7 @@
 #include <map>
 #include <memory>
 
-#include "hostlib/curl_global.h"
+#include "hostlib/http/curl_global.h"
 #include "local_servers.h"
 #include "snapshot/snapshot.h"
 #include "static_api.h"

@@ -18,7 +18,7 @@ fi
 out="$build/fuzz"
 mkdir -p "$out"
 clang++ -std=c++17 -g -O1 -fsanitize=fuzzer,address,undefined -fno-sanitize-recover=all \
-  -I"$root" tests/fuzz/multipart_parser_fuzz.cpp hostlib/multipart_parser.cpp \
+  -I"$root" tests/fuzz/multipart_parser_fuzz.cpp hostlib/http/multipart_parser.cpp \
   -o "$out/multipart_parser_fuzz"
 
 corpus=$(mktemp -d)

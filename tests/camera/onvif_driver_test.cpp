@@ -9,8 +9,8 @@
 
 #include "camera/sim_http.h"
 #include "host/camera.h"
-#include "hostlib/onvif_camera.h"
-#include "hostlib/onvif_soap.h"
+#include "hostlib/camera/onvif_camera.h"
+#include "hostlib/camera/onvif_soap.h"
 #include "support/camsim.h"
 
 namespace {

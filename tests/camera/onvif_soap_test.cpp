@@ -1,6 +1,6 @@
 // ONVIF SOAP building and reading: replies written the ways different cameras
 // write them, faults, signed requests and preset token positions.
-#include "hostlib/onvif_soap.h"
+#include "hostlib/camera/onvif_soap.h"
 
 #include <gtest/gtest.h>
 

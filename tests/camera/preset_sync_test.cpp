@@ -5,9 +5,9 @@
 
 #include "camera/sim_http.h"
 #include "common/pg_test_util.h"
-#include "hostlib/camera_status.h"
-#include "hostlib/onvif_camera.h"
-#include "hostlib/onvif_soap.h"
+#include "hostlib/db/camera_status.h"
+#include "hostlib/camera/onvif_camera.h"
+#include "hostlib/camera/onvif_soap.h"
 #include "patrol/patrol.h"
 #include "support/camsim.h"
 

@@ -10,8 +10,8 @@
 #include "common/pg_test_util.h"
 #include "executor/guardExecutor.h"
 #include "executor/patrolExecutor.h"
-#include "hostlib/camera_status.h"
-#include "hostlib/onvif_camera.h"
+#include "hostlib/db/camera_status.h"
+#include "hostlib/camera/onvif_camera.h"
 #include "patrol/patrol.h"
 #include "support/camsim.h"
 

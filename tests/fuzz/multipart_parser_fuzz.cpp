@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "hostlib/multipart_parser.h"
+#include "hostlib/http/multipart_parser.h"
 
 namespace {
 

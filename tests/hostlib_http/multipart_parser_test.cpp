@@ -4,7 +4,7 @@
 
 #include <gtest/gtest.h>
 
-#include "hostlib/multipart_parser.h"
+#include "hostlib/http/multipart_parser.h"
 
 namespace {
 

@@ -7,7 +7,7 @@
 
 #include "common/pg_test_util.h"
 #include "host/camera.h"
-#include "hostlib/camera_status.h"
+#include "hostlib/db/camera_status.h"
 #include "patrol/patrol.h"
 
 namespace {

@@ -7,7 +7,7 @@
 
 #include "host/camera.h"
 #include "host/database.h"
-#include "hostlib/camera_status.h"
+#include "hostlib/db/camera_status.h"
 
 namespace {
 

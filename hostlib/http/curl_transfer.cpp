@@ -1,4 +1,4 @@
-#include "hostlib/curl_transfer.h"
+#include "hostlib/http/curl_transfer.h"
 
 #include <curl/curl.h>
 
@@ -6,7 +6,7 @@
 #include <cctype>
 #include <cstring>
 
-#include "hostlib/curl_global.h"
+#include "hostlib/http/curl_global.h"
 
 struct CurlTransfer::Curl {
     CURLM* multi = nullptr;

@@ -1,5 +1,5 @@
 // ONVIF SOAP 1.2 messages (see onvif_soap.h).
-#include "hostlib/onvif_soap.h"
+#include "hostlib/camera/onvif_soap.h"
 
 #include <limits.h>
 #include <openssl/evp.h>

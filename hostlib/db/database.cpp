@@ -10,7 +10,7 @@
 #include <vector>
 
 #include "host/database.h"
-#include "hostlib/database_config.h"
+#include "hostlib/db/database_config.h"
 
 const char* gszTablePatrol = "patrol";
 const char* gszTablePatrolPresetData = "patrol_preset";

@@ -6,8 +6,8 @@
 #include <cstring>
 
 #include "host/http.h"
-#include "hostlib/curl_transfer.h"
-#include "hostlib/multipart_parser.h"
+#include "hostlib/http/curl_transfer.h"
+#include "hostlib/http/multipart_parser.h"
 
 struct OvHttpClient::Impl {
     CurlTransfer::Request request;

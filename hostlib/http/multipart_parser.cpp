@@ -1,4 +1,4 @@
-#include "hostlib/multipart_parser.h"
+#include "hostlib/http/multipart_parser.h"
 
 #include <algorithm>
 #include <cctype>

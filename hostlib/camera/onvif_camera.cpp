@@ -1,5 +1,5 @@
 // ONVIF camera driver (see onvif_camera.h).
-#include "hostlib/onvif_camera.h"
+#include "hostlib/camera/onvif_camera.h"
 
 #include <curl/curl.h>
 #include <stdlib.h>
@@ -13,8 +13,8 @@
 #include <mutex>
 #include <vector>
 
-#include "hostlib/curl_global.h"
-#include "hostlib/onvif_soap.h"
+#include "hostlib/http/curl_global.h"
+#include "hostlib/camera/onvif_soap.h"
 
 namespace onvif {
 namespace {

@@ -3,7 +3,7 @@
 #include <strings.h>
 
 #include "host/camera.h"
-#include "hostlib/onvif_camera.h"
+#include "hostlib/camera/onvif_camera.h"
 
 namespace {
 

@@ -1,4 +1,4 @@
-#include "hostlib/curl_global.h"
+#include "hostlib/http/curl_global.h"
 
 #include <curl/curl.h>
 
