@@ -1,8 +1,8 @@
 // Database services the library takes from the host.
 //
-// The library builds whole PostgreSQL statements and hands them over one at a
-// time; it never talks to the server itself. Every function here may be called
-// from several threads at once.
+// The library builds whole PostgreSQL statements and hands them over; it never
+// talks to the server itself. Every function here may be called from several
+// threads at once.
 #ifndef HOST_DATABASE_H
 #define HOST_DATABASE_H
 
@@ -16,7 +16,14 @@ struct DBResult_tag;
 // (release them with KELODBFreeResult). Non-zero: failure, *result untouched.
 int OvDBExecute(const std::string& sql, DBResult_tag** result);
 
-// Runs one statement whose rows are not wanted. 0: success, non-zero: failure.
+// Runs statements whose rows are not wanted: one statement, or several, each
+// ending in ";" (one per line), which must run as ONE transaction: either
+// every statement takes effect or none does, also when the connection or the
+// server goes away in the middle, and other sessions see none of the changes
+// before all of them. libpq's PQexec runs a string of several statements
+// without BEGIN/COMMIT in this way. The library rewrites a patrol's presets
+// with such a batch. 0: success (all committed), non-zero: failure (nothing
+// committed).
 int OvDBExecute(const std::string& sql);
 
 // Escapes text so that it can stand between single quotes in a statement.

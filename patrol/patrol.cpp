@@ -76,6 +76,40 @@ bool FormatStatement(char* buffer, const char* format, Args... args) {
     return n >= 0 && static_cast<size_t>(n) < kStatementSize;
 }
 
+// Statement that takes the patrol row's lock at the head of a preset rewrite,
+// so that two rewrites of one patrol run one after the other: the second
+// deletes what the first wrote instead of leaving both lists behind.
+std::string PatrolLockStatement(int id) {
+    return std::string("SELECT id FROM ") + gszTablePatrol + " WHERE id = " + itos(id) + " FOR UPDATE;";
+}
+
+std::string PresetDeleteStatement(int id) {
+    return std::string("DELETE FROM ") + gszTablePatrolPresetData + " WHERE " + "patrolId" + " = " +
+           itos(id) + ";";
+}
+
+// Appends to `batch` one insert per preset, each on a line of its own,
+// formatted in `buffer`. Every statement is formed before anything runs, so a
+// batch is all-or-nothing. -1 when all fit; else the index of the first
+// preset whose insert does not fit the statement buffer.
+int AppendPresetInserts(std::string& batch, char* buffer, int camId, int id,
+                        const std::vector<PRESET_INFO>& presets) {
+    for (size_t i = 0; i < presets.size(); ++i) {
+        const std::string escaped = OvDBEscapeString(presets[i].name);
+        const int sequence = static_cast<int>(i);
+        if (!FormatStatement(buffer,
+                             "INSERT INTO %s (id, camId, patrolId, position, name, sequence ) VALUES "
+                             "(DEFAULT, %d, %d, %d, '%s', %d);",
+                             gszTablePatrolPresetData, camId, id, presets[i].position, escaped.c_str(),
+                             sequence)) {
+            return sequence;
+        }
+        batch += '\n';
+        batch += buffer;
+    }
+    return -1;
+}
+
 // Releases a result on every way out.
 struct ResultHolder {
     DBResult_tag* result = nullptr;
@@ -172,36 +206,51 @@ int Patrol::Save() {
         return -1;
     }
     const std::string escaped = OvDBEscapeString(name);
-    const bool insert = (id == 0);
-    bool fits;
-    if (insert) {
-        fits = FormatStatement(buffer.get(),
-                               "INSERT INTO %s (id, camId, name, stayTime ) VALUES (DEFAULT, %d, "
-                               "'%s', %d) RETURNING id;",
-                               gszTablePatrol, camId, escaped.c_str(), stayTime);
-    } else {
-        fits = FormatStatement(buffer.get(),
-                               "UPDATE %s SET camId = %d, name = '%s', stayTime = %d WHERE id = %d;",
-                               gszTablePatrol, camId, escaped.c_str(), stayTime, id);
+    if (id > 0) {
+        // A stored patrol: its row and its presets are rewritten by one batch,
+        // which the host runs as one transaction. The update takes the row's
+        // lock first, so concurrent saves of the patrol are ordered by it.
+        if (!FormatStatement(buffer.get(),
+                             "UPDATE %s SET camId = %d, name = '%s', stayTime = %d WHERE id = %d;",
+                             gszTablePatrol, camId, escaped.c_str(), stayTime, id)) {
+            PATROL_LOG("Failed to execute SQL command");
+            return -1;
+        }
+        std::string batch = std::string(buffer.get()) + "\n" + PresetDeleteStatement(id);
+        const int tooLong = AppendPresetInserts(batch, buffer.get(), camId, id, presetList);
+        if (tooLong >= 0) {
+            PATROL_LOG("Failed to execute SQL command to save preset#%d.", tooLong);
+            return -1;
+        }
+        if (OvDBExecute(batch) != 0) {
+            PATROL_LOG("Failed to execute SQL command to save patrol %d.", id);
+            return -1;
+        }
+        return 0;
     }
 
+    // A new patrol: the insert gives the id that its presets are stored under.
     ResultHolder result;
-    if (!fits || OvDBExecute(buffer.get(), &result.result) != 0) {
+    if (!FormatStatement(buffer.get(),
+                         "INSERT INTO %s (id, camId, name, stayTime ) VALUES (DEFAULT, %d, "
+                         "'%s', %d) RETURNING id;",
+                         gszTablePatrol, camId, escaped.c_str(), stayTime) ||
+        OvDBExecute(buffer.get(), &result.result) != 0) {
         PATROL_LOG("Failed to execute SQL command");
         return -1;
     }
-    if (insert) {
-        if (KELODBNumRows(result.result) != 1) {
-            PATROL_LOG("Failed to get result");
-            return -1;
-        }
-        unsigned int row = 0;
-        if (KELODBFetchRow(result.result, &row) != 0) {
-            PATROL_LOG("Failed to get id");
-            return -1;
-        }
-        id = FieldToInt(KELODBFetchField(result.result, 0, "id"));
+    if (KELODBNumRows(result.result) != 1) {
+        PATROL_LOG("Failed to get result");
+        return -1;
     }
+    unsigned int row = 0;
+    if (KELODBFetchRow(result.result, &row) != 0) {
+        PATROL_LOG("Failed to get id");
+        return -1;
+    }
+    id = FieldToInt(KELODBFetchField(result.result, 0, "id"));
+    // If the presets fail now, the row stays stored and keeps its id here, so
+    // a retried Save updates this row instead of inserting another.
     return SavePresetInfo();
 }
 
@@ -255,37 +304,31 @@ int Patrol::LoadPresetInfo() {
 }
 
 int Patrol::SavePresetInfo() {
-    const int count = GetPresetListNum();
     if (id <= 0) {
         PATROL_LOG("Invalid patrol id");
         return -2;
     }
-    if (DelAllPresetInfo() != 0) {
-        PATROL_LOG("Cannot delete all presets.\n");
-        return -1;
-    }
-    if (count == 0) return 0;
-
-    StatementBuffer buffer = NewStatementBuffer();
-    if (!buffer) {
-        PATROL_LOG("Out of memory");
-        return -1;
-    }
-    int rc = 0;
-    for (int i = 0; i < count; ++i) {
-        const PRESET_INFO& preset = presetList[i];
-        const std::string escaped = OvDBEscapeString(preset.name);
-        const bool fits = FormatStatement(
-            buffer.get(),
-            "INSERT INTO %s (id, camId, patrolId, position, name, sequence ) VALUES (DEFAULT, %d, "
-            "%d, %d, '%s', %d);",
-            gszTablePatrolPresetData, camId, id, preset.position, escaped.c_str(), i);
-        if (!fits || OvDBExecute(buffer.get()) != 0) {
-            PATROL_LOG("Failed to execute SQL command to save preset#%d.", i);
-            rc = -1;
+    // The delete and the inserts go to the host as one batch, run as one
+    // transaction: a failure leaves the stored presets as they were, and a
+    // reader sees the old list or the new one, never a mix.
+    std::string batch = PatrolLockStatement(id) + "\n" + PresetDeleteStatement(id);
+    if (!presetList.empty()) {
+        StatementBuffer buffer = NewStatementBuffer();
+        if (!buffer) {
+            PATROL_LOG("Out of memory");
+            return -1;
+        }
+        const int tooLong = AppendPresetInserts(batch, buffer.get(), camId, id, presetList);
+        if (tooLong >= 0) {
+            PATROL_LOG("Failed to execute SQL command to save preset#%d.", tooLong);
+            return -1;
         }
     }
-    return rc;
+    if (OvDBExecute(batch) != 0) {
+        PATROL_LOG("Failed to execute SQL command to save presets of patrol %d.", id);
+        return -1;
+    }
+    return 0;
 }
 
 int Patrol::DelAllPresetInfo() {
@@ -293,9 +336,7 @@ int Patrol::DelAllPresetInfo() {
         PATROL_LOG("Invalid patrol id");
         return -2;
     }
-    const std::string sql = std::string("DELETE FROM ") + gszTablePatrolPresetData + " WHERE " +
-                            "patrolId" + " = " + itos(id) + ";";
-    if (OvDBExecute(sql) != 0) {
+    if (OvDBExecute(PresetDeleteStatement(id)) != 0) {
         PATROL_LOG("Failed to delete preset data of patrol %d", id);
         return -1;
     }

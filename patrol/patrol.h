@@ -43,7 +43,11 @@ public:
     // Reads the patrol row, then its presets (which talks to the camera).
     int Load(int id);
     // Inserts (id 0) or updates (id > 0) the patrol row, then replaces its presets.
-    // Cuts the name to 256 bytes first, never inside a UTF-8 character.
+    // Cuts the name to 256 bytes first, never inside a UTF-8 character. A
+    // stored patrol's row and presets are written in one transaction: on -1
+    // nothing of them changed. A new patrol's row is inserted first; if its
+    // presets then fail, the row stays (with no presets) and the object keeps
+    // its id, so a retried Save updates that row rather than adding another.
     int Save();
     // Deletes the patrol row, then its preset rows. The object keeps its fields.
     int Delete();
@@ -53,7 +57,10 @@ public:
     // Reads the stored presets in sequence order, then brings them in line
     // with the camera (UpdatePresetInfo).
     int LoadPresetInfo();
-    // Replaces all stored presets of the patrol by the in-memory list.
+    // Replaces all stored presets of the patrol by the in-memory list, in one
+    // transaction that first takes the patrol row's lock: on -1 the stored
+    // presets are as they were, a concurrent Load sees the old list or the
+    // new one, and concurrent saves of one patrol leave one writer's list.
     int SavePresetInfo();
     // Deletes all stored presets of the patrol.
     int DelAllPresetInfo();

@@ -177,6 +177,10 @@ int OvDBExecute(const std::string& sql, DBResult_tag** result) {
     return 0;
 }
 
+// Several statements in one string go to the server as one simple query,
+// which runs them as one implicit transaction: the first error aborts it and
+// rolls back the statements before it, and a connection lost midway commits
+// nothing. PQexec hands back the last result, the error one if any failed.
 int OvDBExecute(const std::string& sql) {
     PGresult* res = Run(sql);
     if (!res) return -1;

@@ -3,12 +3,16 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
 #include <thread>
 
 #include "common/pg_test_util.h"
 #include "host/camera.h"
 #include "hostlib/db/camera_status.h"
 #include "patrol/patrol.h"
+#include "patrol_pg_lists.h"
 
 namespace {
 
@@ -35,6 +39,7 @@ std::vector<std::pair<int, std::string>> Presets(const Patrol& p) {
 class PatrolDatabase : public ::testing::Test {
 protected:
     void SetUp() override {
+        pgtest::Exec("DROP TRIGGER IF EXISTS ptz_slow ON patrol_preset;");
         pgtest::ResetTables();
         // Cameras without a record: the preset sync stops at the record and
         // leaves the stored presets alone.
@@ -126,15 +131,132 @@ TEST_F(PatrolDatabase, AwkwardNamesAreStoredExactly) {
     ASSERT_EQ(back.Load(ascii.GetId()), 0);
     EXPECT_EQ(back.GetName(), std::string(256, 'a'));
 
-    // A preset name too long for a statement is not stored; the others are.
-    Patrol big(1, "big", 1);
-    big.AddPresetToList(Preset(1, "one"));
-    big.AddPresetToList(Preset(2, std::string(20000, 'x')));
-    big.AddPresetToList(Preset(3, "three"));
-    EXPECT_EQ(big.Save(), -1);
-    ASSERT_EQ(back.Load(big.GetId()), 0);
-    EXPECT_THAT(Presets(back), ElementsAre(std::make_pair(1, std::string("one")),
-                                           std::make_pair(3, std::string("three"))));
+}
+
+// Every stored preset row, row ids included: equal dumps mean nothing was rewritten.
+std::vector<std::string> PresetRows() {
+    return pgtest::Column("SELECT concat_ws('|', id, patrolId, position, name, sequence) AS r "
+                          "FROM patrol_preset ORDER BY id;", "r");
+}
+
+TEST_F(PatrolDatabase, AFailedSaveLeavesTheStoredPresetsAsTheyWere) {
+    Patrol p(1, "gate", 1);
+    p.AddPresetToList(Preset(1, "one"));
+    p.AddPresetToList(Preset(2, "two"));
+    p.AddPresetToList(Preset(3, "three"));
+    ASSERT_EQ(p.Save(), 0);
+    const auto before = PresetRows();
+    const std::string invalidUtf8 = "bad \xC3\x28 name";
+    const std::string tooLong(20000, 'x');  // its insert cannot fit a statement
+
+    for (const std::string& name : {invalidUtf8, tooLong}) {
+        Patrol edit;
+        ASSERT_EQ(edit.Load(p.GetId()), 0);
+        edit.DelAllPreset();
+        edit.AddPresetToList(Preset(1, "one"));
+        edit.AddPresetToList(Preset(2, name));
+        edit.SetName("renamed");
+        EXPECT_EQ(edit.Save(), -1);
+        EXPECT_EQ(edit.SavePresetInfo(), -1);
+        EXPECT_EQ(PresetRows(), before);
+        EXPECT_THAT(pgtest::Column("SELECT name FROM patrol;", "name"), ElementsAre("gate"));
+    }
+
+    // A new patrol whose presets fail: its row stays, without presets, and
+    // keeps its id in the object, so a retry updates that row.
+    Patrol fresh(1, "fresh", 1);
+    fresh.AddPresetToList(Preset(4, "four"));
+    fresh.AddPresetToList(Preset(5, invalidUtf8));
+    EXPECT_EQ(fresh.Save(), -1);
+    ASSERT_GT(fresh.GetId(), 0);
+    EXPECT_EQ(PresetRows(), before);
+    fresh.DelAllPreset();
+    fresh.AddPresetToList(Preset(4, "four"));
+    EXPECT_EQ(fresh.Save(), 0);
+    EXPECT_THAT(pgtest::Column("SELECT count(*) AS n FROM patrol;", "n"), ElementsAre("2"));
+    Patrol back;
+    ASSERT_EQ(back.Load(fresh.GetId()), 0);
+    EXPECT_THAT(Presets(back), ElementsAre(std::make_pair(4, std::string("four"))));
+}
+
+// The server stops while a save's statements run: a trigger holds the insert
+// of a preset named "slow" until a fast shutdown ends the session.
+TEST_F(PatrolDatabase, AServerStoppedInTheMiddleOfASaveCommitsNothingAndARetryWorks) {
+    pgtest::Exec("CREATE OR REPLACE FUNCTION ptz_slow() RETURNS trigger AS $$ BEGIN "
+                 "IF NEW.name = 'slow' THEN PERFORM pg_sleep(60); END IF; RETURN NEW; END $$ "
+                 "LANGUAGE plpgsql;");
+    pgtest::Exec("CREATE TRIGGER ptz_slow BEFORE INSERT ON patrol_preset FOR EACH ROW "
+                 "EXECUTE FUNCTION ptz_slow();");
+    Patrol stored(1, "stored", 1);
+    stored.AddPresetToList(Preset(1, "one"));
+    ASSERT_EQ(stored.Save(), 0);
+    const auto before = PresetRows();
+
+    const auto saveWhileStopping = [](Patrol& p) {
+        int rc = 0;
+        std::thread saver([&] { rc = p.Save(); });
+        bool sleeping = false;
+        for (int i = 0; i < 1000 && !sleeping; ++i) {  // up to 10 s
+            sleeping = pgtest::Column("SELECT count(*) AS n FROM pg_stat_activity "
+                                      "WHERE wait_event = 'PgSleep';", "n") == std::vector<std::string>{"1"};
+            if (!sleeping) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        }
+        EXPECT_TRUE(sleeping);
+        EXPECT_EQ(pgtest::Cluster("down"), 0);
+        saver.join();
+        EXPECT_EQ(pgtest::Cluster("up"), 0);
+        return rc;
+    };
+
+    stored.DelAllPreset();
+    stored.AddPresetToList(Preset(2, "two"));
+    stored.AddPresetToList(Preset(3, "slow"));
+    EXPECT_EQ(saveWhileStopping(stored), -1);
+    EXPECT_EQ(PresetRows(), before);
+
+    Patrol fresh(1, "fresh", 1);
+    fresh.AddPresetToList(Preset(4, "slow"));
+    EXPECT_EQ(saveWhileStopping(fresh), -1);
+    EXPECT_EQ(PresetRows(), before);
+
+    pgtest::Exec("DROP TRIGGER ptz_slow ON patrol_preset;");
+    EXPECT_EQ(fresh.Save(), 0);  // the retry updates the row the first attempt made
+    EXPECT_THAT(pgtest::Column("SELECT count(*) AS n FROM patrol;", "n"), ElementsAre("2"));
+    EXPECT_THAT(pgtest::Column("SELECT name FROM patrol_preset WHERE patrolId = " + itos(fresh.GetId()) + ";",
+                               "name"),
+                ElementsAre("slow"));
+}
+
+// Two processes each load one patrol, check the list they read, and save
+// their own list, over and over: every load sees one writer's whole list and
+// the table ends with one writer's list.
+TEST_F(PatrolDatabase, ConcurrentSavesAndLoadsOfOnePatrolNeverSeeAMix) {
+    Patrol p(1, "shared", 1);
+    writerlists::Fill(p, 'A');
+    ASSERT_EQ(p.Save(), 0);
+    const std::string writer = std::string(std::getenv("PTZ_BINARY_DIR")) + "/tests/patrol/patrol_pg_writer";
+    constexpr int kRounds = 100;
+    std::vector<FILE*> procs;
+    for (const char* tag : {"A", "B"}) {
+        const std::string cmd = writer + " " + itos(p.GetId()) + " " + tag + " " + itos(kRounds);
+        procs.push_back(popen(cmd.c_str(), "r"));
+        ASSERT_NE(procs.back(), nullptr);
+    }
+    for (FILE* f : procs) {
+        char line[128] = {};
+        ASSERT_NE(fgets(line, sizeof line, f), nullptr);
+        EXPECT_EQ(pclose(f), 0);
+        int loads = -1, torn = -1, failed = -1;
+        ASSERT_EQ(sscanf(line, "loads=%d torn=%d failed=%d", &loads, &torn, &failed), 3) << line;
+        EXPECT_EQ(loads, kRounds);
+        EXPECT_EQ(torn, 0);
+        EXPECT_EQ(failed, 0);
+    }
+    Patrol back;
+    ASSERT_EQ(back.Load(p.GetId()), 0);
+    EXPECT_TRUE(writerlists::IsWholeList(back));
+    EXPECT_THAT(pgtest::Column("SELECT sequence FROM patrol_preset ORDER BY sequence;", "sequence"),
+                ElementsAre("0", "1", "2", "3", "4", "5", "6", "7"));
 }
 
 TEST_F(PatrolDatabase, ListingsAreOrderedByIdAndBadInputGetsClearResults) {

@@ -36,6 +36,16 @@ std::string PresetInsert(int camId, int id, int pos, const std::string& name, in
            "', " + std::to_string(seq) + ");";
 }
 
+std::string PatrolLock(int id) {
+    return "SELECT id FROM patrol WHERE id = " + std::to_string(id) + " FOR UPDATE;";
+}
+// Statements handed over as one transaction: one per line.
+std::string Batch(const std::vector<std::string>& statements) {
+    std::string out;
+    for (const auto& s : statements) out += (out.empty() ? "" : "\n") + s;
+    return out;
+}
+
 // Log texts without the "file:line:" prefix, which carries a line number.
 std::vector<std::string> Messages() {
     std::vector<std::string> out;
@@ -166,23 +176,27 @@ TEST_F(PatrolStore, PresetFieldsConvertLikeStrtolAndNullsReadAsZeroOrEmpty) {
     EXPECT_EQ(b.name, "");
 }
 
-TEST_F(PatrolStore, SaveInsertsTakesTheNewIdThenRewritesPresets) {
+TEST_F(PatrolStore, SaveInsertsTakesTheNewIdThenRewritesPresetsInOneBatch) {
     Patrol p(3, "it's", 5);
     p.AddPresetToList(Preset(7, "o'clock"));
     p.AddPresetToList(Preset(1, "100%"));
     fake::OnSql("INSERT INTO patrol ", {0, {{{"id", "31"}}}});
     EXPECT_EQ(p.Save(), 0);
     EXPECT_EQ(p.GetId(), 31);
+    const std::string presets = Batch({PresetDelete(31), PresetInsert(3, 31, 7, "o''clock", 0),
+                                       PresetInsert(3, 31, 1, "100%", 1)});
     EXPECT_THAT(fake::Statements(),
                 ElementsAre("INSERT INTO patrol (id, camId, name, stayTime ) VALUES (DEFAULT, 3, 'it''s', 5) "
                             "RETURNING id;",
-                            PresetDelete(31), PresetInsert(3, 31, 7, "o''clock", 0),
-                            PresetInsert(3, 31, 1, "100%", 1)));
+                            Batch({PatrolLock(31), presets})));
 
-    EXPECT_EQ(p.Save(), 0);  // now an update of the same row
-    EXPECT_EQ(fake::Statements()[4],
-              "UPDATE patrol SET camId = 3, name = 'it''s', stayTime = 5 WHERE id = 31;");
-    EXPECT_EQ(fake::Statements().size(), 8u);
+    // Now an update of the same row, in the same transaction as its presets;
+    // the update takes the row's lock first.
+    EXPECT_EQ(p.Save(), 0);
+    EXPECT_EQ(fake::Statements().back(),
+              Batch({"UPDATE patrol SET camId = 3, name = 'it''s', stayTime = 5 WHERE id = 31;", presets}));
+    EXPECT_EQ(fake::Statements().size(), 3u);
+    EXPECT_EQ(fake::ResultsOutstanding(), 0);
 }
 
 TEST_F(PatrolStore, SaveFailuresKeepIdZeroAndWriteNoPresets) {
@@ -237,35 +251,42 @@ TEST_F(PatrolStore, SaveCutsNamesAt256BytesWithoutSplittingUtf8) {
     EXPECT_EQ(stray.GetName().size(), 256u);
 }
 
-TEST_F(PatrolStore, SavePresetInfoKeepsGoingPastAFailedOrOversizedInsert) {
-    fake::OnSql(PatrolSelect(12), {0, {PatrolRow(12, 3, "gate", 4)}});
-    Patrol p;
-    p.Load(12);
-    p.AddPresetToList(Preset(1, "a"));
-    p.AddPresetToList(Preset(2, "b"));
-    p.AddPresetToList(Preset(3, std::string(17000, 'z')));  // cannot fit the statement buffer
-    p.AddPresetToList(Preset(7, "d"));
-    fake::OnSql(PresetInsert(3, 12, 2, "b", 1), {-1, {}});
-    const size_t before = fake::Statements().size();
-    EXPECT_EQ(p.SavePresetInfo(), -1);
-    const auto all = fake::Statements();
-    EXPECT_THAT(std::vector<std::string>(all.begin() + before, all.end()),
-                ElementsAre(PresetDelete(12), PresetInsert(3, 12, 1, "a", 0), PresetInsert(3, 12, 2, "b", 1),
-                            PresetInsert(3, 12, 7, "d", 3)));
-    EXPECT_THAT(Messages(), ElementsAre("SavePresetInfo(): Failed to execute SQL command to save preset#1.",
-                                        "SavePresetInfo(): Failed to execute SQL command to save preset#2."));
-}
-
-TEST_F(PatrolStore, SavePresetInfoStopsWhenTheDeleteFails) {
+TEST_F(PatrolStore, APresetRewriteIsAllOrNothing) {
     StorePatrol({});
     Patrol p;
     p.Load(12);
     p.AddPresetToList(Preset(1, "a"));
-    fake::OnSql(PresetDelete(12), {-1, {}});
+    p.AddPresetToList(Preset(2, "b"));
+    const size_t loaded = fake::Statements().size();
+
+    // The server refuses the batch: nothing else is tried.
+    fake::OnSql(PresetInsert(3, 12, 2, "b", 1), {-1, {}}, 2);
     EXPECT_EQ(p.SavePresetInfo(), -1);
-    EXPECT_THAT(Messages(), ElementsAre("DelAllPresetInfo(): Failed to delete preset data of patrol 12",
-                                        "SavePresetInfo(): Cannot delete all presets.\n"));
-    EXPECT_EQ(fake::Statements().back(), PresetDelete(12));
+    EXPECT_EQ(p.Save(), -1);
+    const auto sql = fake::Statements();
+    EXPECT_THAT(std::vector<std::string>(sql.begin() + loaded, sql.end()),
+                ElementsAre(Batch({PatrolLock(12), PresetDelete(12), PresetInsert(3, 12, 1, "a", 0),
+                                   PresetInsert(3, 12, 2, "b", 1)}),
+                            Batch({"UPDATE patrol SET camId = 3, name = 'gate', stayTime = 4 WHERE id = 12;",
+                                   PresetDelete(12), PresetInsert(3, 12, 1, "a", 0),
+                                   PresetInsert(3, 12, 2, "b", 1)})));
+
+    // An insert that cannot fit the statement buffer fails the save before
+    // anything runs, the patrol's update included.
+    p.AddPresetToList(Preset(3, std::string(17000, 'z')));
+    EXPECT_EQ(p.SavePresetInfo(), -1);
+    EXPECT_EQ(p.Save(), -1);
+    EXPECT_EQ(fake::Statements().size(), loaded + 2);
+    EXPECT_THAT(Messages(),
+                ElementsAre("SavePresetInfo(): Failed to execute SQL command to save presets of patrol 12.",
+                            "Save(): Failed to execute SQL command to save patrol 12.",
+                            "SavePresetInfo(): Failed to execute SQL command to save preset#2.",
+                            "Save(): Failed to execute SQL command to save preset#2."));
+
+    // An empty list: the lock and the delete, still as one batch.
+    p.DelAllPreset();
+    EXPECT_EQ(p.SavePresetInfo(), 0);
+    EXPECT_EQ(fake::Statements().back(), Batch({PatrolLock(12), PresetDelete(12)}));
 }
 
 TEST_F(PatrolStore, IdZeroIsRefusedForSaveAndDeleteButLoadsPresets) {
@@ -328,8 +349,8 @@ TEST_F(PatrolStore, SyncDropsMissingPositionsKeepsOrderNamesAndDuplicates) {
     EXPECT_EQ(first.name, "n1");  // the stored name, not the camera's
     const auto sql = fake::Statements();
     EXPECT_THAT(std::vector<std::string>(sql.begin() + 2, sql.end()),
-                ElementsAre(PresetDelete(12), PresetInsert(3, 12, 1, "n1", 0), PresetInsert(3, 12, 3, "n3", 1),
-                            PresetInsert(3, 12, 1, "n1", 2)));
+                ElementsAre(Batch({PatrolLock(12), PresetDelete(12), PresetInsert(3, 12, 1, "n1", 0),
+                                   PresetInsert(3, 12, 3, "n3", 1), PresetInsert(3, 12, 1, "n1", 2)})));
 }
 
 TEST_F(PatrolStore, SyncWritesNothingWhenNothingIsDroppedAndDropsAllForAnEmptyCamera) {
@@ -342,7 +363,7 @@ TEST_F(PatrolStore, SyncWritesNothingWhenNothingIsDroppedAndDropsAllForAnEmptyCa
     fake::CameraHost("cam3").presets.clear();
     EXPECT_EQ(p.UpdatePresetInfo(), 0);
     EXPECT_EQ(p.GetPresetListNum(), 0);
-    EXPECT_EQ(fake::Statements().back(), PresetDelete(12));
+    EXPECT_EQ(fake::Statements().back(), Batch({PatrolLock(12), PresetDelete(12)}));
 }
 
 TEST_F(PatrolStore, SyncFailuresLeaveTheListAndReleaseWhatWasMade) {
