@@ -5,6 +5,8 @@
 #   pg_cluster.sh restart DIR   restart a running cluster (fast shutdown)
 #   pg_cluster.sh down DIR      stop the server, keep the cluster
 #   pg_cluster.sh up DIR        start it again
+#   pg_cluster.sh stall DIR     freeze the server's processes (SIGSTOP): it answers nothing
+#   pg_cluster.sh resume DIR    let them go on (SIGCONT)
 #   pg_cluster.sh stop DIR      stop the server and remove DIR
 #
 # The server listens only on a unix socket in DIR (no TCP), runs as an
@@ -12,8 +14,8 @@
 # of the database user "ptz". Clients use PGHOST=DIR PGUSER=ptz PGDATABASE=ptztest.
 set -euo pipefail
 
-cmd=${1:?usage: pg_cluster.sh start|restart|down|up|stop DIR}
-dir=${2:?usage: pg_cluster.sh start|restart|down|up|stop DIR}
+cmd=${1:?usage: pg_cluster.sh start|restart|down|up|stall|resume|stop DIR}
+dir=${2:?usage: pg_cluster.sh start|restart|down|up|stall|resume|stop DIR}
 here=$(cd "$(dirname "$0")" && pwd)
 schema="$here/../hostlib/db/schema.sql"
 
@@ -65,6 +67,12 @@ down)
 up)
   server_start
   ;;
+stall|resume)
+  signal=$([ "$cmd" = stall ] && echo STOP || echo CONT)
+  pid=$(head -n 1 "$dir/data/postmaster.pid")
+  kill -"$signal" "$pid"
+  pkill -"$signal" -P "$pid" || true
+  ;;
 stop)
   if [ -d "$dir/data" ]; then
     as_owner "$bindir/pg_ctl" -D "$dir/data" -w -t 60 -m fast stop >/dev/null 2>&1 || true
@@ -73,7 +81,7 @@ stop)
   echo "pg_cluster: stopped $dir"
   ;;
 *)
-  echo "usage: pg_cluster.sh start|restart|down|up|stop DIR" >&2
+  echo "usage: pg_cluster.sh start|restart|down|up|stall|resume|stop DIR" >&2
   exit 2
   ;;
 esac

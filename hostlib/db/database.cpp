@@ -1,8 +1,12 @@
 // PostgreSQL database layer on libpq: a pool of connections, statements run
 // with PQexec, results kept as PGresult until the caller frees them.
+#include <errno.h>
 #include <libpq-fe.h>
 #include <poll.h>
 
+#include <atomic>
+#include <chrono>
+#include <climits>
 #include <condition_variable>
 #include <memory>
 #include <mutex>
@@ -22,18 +26,49 @@ struct DBResult_tag {
 
 namespace {
 
+using Clock = std::chrono::steady_clock;
+
+// How long one statement (or batch) may take, from the wait for a connection
+// to its last result. A stalled server must not hold a host thread forever.
+std::atomic<int> statementTimeoutMs{15000};
+
 struct ConnCloser {
     void operator()(PGconn* c) const { PQfinish(c); }
 };
 using ConnPtr = std::unique_ptr<PGconn, ConnCloser>;
 
+// Waits until the connection's socket is ready for `events`. False at the
+// deadline or on a poll error.
+bool WaitSocket(PGconn* conn, short events, Clock::time_point deadline) {
+    for (;;) {
+        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now()).count();
+        if (left <= 0) return false;
+        struct pollfd pfd = {PQsocket(conn), events, 0};
+        const int rc = poll(&pfd, 1, static_cast<int>(left < INT_MAX ? left : INT_MAX));
+        if (rc > 0) return true;
+        if (rc < 0 && errno != EINTR) return false;
+    }
+}
+
+// Drives a started connection attempt (connect or reset) to its end by the
+// deadline. True when the connection is up.
+bool FinishConnect(PGconn* conn, PostgresPollingStatusType (*pollOnce)(PGconn*), Clock::time_point deadline) {
+    PostgresPollingStatusType st = PGRES_POLLING_WRITING;
+    for (;;) {
+        if (st == PGRES_POLLING_OK) return true;
+        if (st == PGRES_POLLING_FAILED) return false;
+        if (!WaitSocket(conn, st == PGRES_POLLING_READING ? POLLIN : POLLOUT, deadline)) return false;
+        st = pollOnce(conn);
+    }
+}
+
 class Pool {
 public:
     // Borrows a working connection, opening one if needed. Null when the
     // server cannot be reached.
-    ConnPtr Acquire() {
+    ConnPtr Acquire(Clock::time_point deadline) {
         std::unique_lock<std::mutex> lock(mu_);
-        cv_.wait(lock, [&] { return !idle_.empty() || open_ < size_; });
+        if (!cv_.wait_until(lock, deadline, [&] { return !idle_.empty() || open_ < size_; })) return nullptr;
         ConnPtr conn;
         std::string conninfo = conninfo_;
         if (!idle_.empty()) {
@@ -45,9 +80,11 @@ public:
         const unsigned generation = generation_;
         lock.unlock();
 
-        if (conn && !Healthy(conn.get())) PQreset(conn.get());
-        if (!conn) conn = Connect(conninfo);
-        if (conn && PQstatus(conn.get()) != CONNECTION_OK) conn.reset();
+        if (conn && !Healthy(conn.get()) &&
+            (PQresetStart(conn.get()) != 1 || !FinishConnect(conn.get(), PQresetPoll, deadline))) {
+            conn.reset();
+        }
+        if (!conn) conn = Connect(conninfo, deadline);
         if (!conn) {
             Release(nullptr, generation);
             return nullptr;
@@ -96,13 +133,17 @@ public:
     }
 
 private:
-    static ConnPtr Connect(const std::string& conninfo) {
-        // Later keywords win: the host's settings may override the timeout.
-        const char* keys[] = {"connect_timeout", "dbname", "client_encoding", nullptr};
-        const char* values[] = {"10", conninfo.c_str(), "UTF8", nullptr};
-        ConnPtr conn(PQconnectdbParams(keys, values, 1));
+    // Opens a connection by the deadline; null when that fails.
+    static ConnPtr Connect(const std::string& conninfo, Clock::time_point deadline) {
+        const char* keys[] = {"dbname", "client_encoding", nullptr};
+        const char* values[] = {conninfo.c_str(), "UTF8", nullptr};
+        ConnPtr conn(PQconnectStartParams(keys, values, 1));
+        if (!conn || PQstatus(conn.get()) == CONNECTION_BAD ||
+            !FinishConnect(conn.get(), PQconnectPoll, deadline)) {
+            return nullptr;
+        }
         // Server notices are not the host's business; libpq would print them to stderr.
-        if (conn) PQsetNoticeProcessor(conn.get(), [](void*, const char*) {}, nullptr);
+        PQsetNoticeProcessor(conn.get(), [](void*, const char*) {}, nullptr);
         return conn;
     }
 
@@ -133,7 +174,8 @@ Pool& ThePool() {
 // Borrowed connection, returned to the pool on every way out.
 class Lease {
 public:
-    Lease() : generation_(ThePool().Generation()), conn_(ThePool().Acquire()) {}
+    explicit Lease(Clock::time_point deadline)
+        : generation_(ThePool().Generation()), conn_(ThePool().Acquire(deadline)) {}
     ~Lease() {
         if (conn_) ThePool().Release(std::move(conn_), generation_);
     }
@@ -146,13 +188,51 @@ private:
     ConnPtr conn_;
 };
 
-// Runs one statement; the result on success, null on failure.
-PGresult* Run(const std::string& sql) {
-    Lease lease;
-    if (!lease.get()) return nullptr;
-    PGresult* res = PQexec(lease.get(), sql.c_str());
+bool IsError(const PGresult* res) {
     const ExecStatusType st = PQresultStatus(res);
-    if (st != PGRES_TUPLES_OK && st != PGRES_COMMAND_OK) {
+    return st != PGRES_TUPLES_OK && st != PGRES_COMMAND_OK;
+}
+
+// Sends `sql` and collects its results by the deadline, without blocking
+// beyond it: the first error result, else the last result. Null when the
+// connection failed or the deadline passed; the connection is then left mid
+// query, and the pool drops it when it comes back.
+PGresult* ExecBounded(PGconn* conn, const std::string& sql, Clock::time_point deadline) {
+    if (PQsetnonblocking(conn, 1) != 0 || PQsendQuery(conn, sql.c_str()) != 1) return nullptr;
+    for (;;) {  // a large statement may not fit the socket at once
+        const int flushed = PQflush(conn);
+        if (flushed == 0) break;
+        if (flushed < 0 || !WaitSocket(conn, POLLIN | POLLOUT, deadline) || PQconsumeInput(conn) == 0) {
+            return nullptr;
+        }
+    }
+    PGresult* kept = nullptr;
+    for (;;) {
+        while (PQisBusy(conn)) {
+            if (!WaitSocket(conn, POLLIN, deadline) || PQconsumeInput(conn) == 0) {
+                PQclear(kept);
+                return nullptr;
+            }
+        }
+        PGresult* res = PQgetResult(conn);
+        if (res == nullptr) return kept;
+        if (kept != nullptr && IsError(kept)) {
+            PQclear(res);
+        } else {
+            PQclear(kept);
+            kept = res;
+        }
+    }
+}
+
+// Runs one statement, or several as one transaction; the result on success,
+// null on failure.
+PGresult* Run(const std::string& sql) {
+    const Clock::time_point deadline = Clock::now() + std::chrono::milliseconds(statementTimeoutMs.load());
+    Lease lease(deadline);
+    if (!lease.get()) return nullptr;
+    PGresult* res = ExecBounded(lease.get(), sql, deadline);
+    if (res == nullptr || IsError(res)) {
         PQclear(res);
         return nullptr;
     }
@@ -163,6 +243,7 @@ PGresult* Run(const std::string& sql) {
 
 void HostDBSetConnInfo(const std::string& conninfo) { ThePool().SetConnInfo(conninfo); }
 void HostDBSetPoolSize(int size) { ThePool().SetSize(size); }
+void HostDBSetStatementTimeoutMs(int ms) { statementTimeoutMs = ms > 0 ? ms : 1; }
 void HostDBCloseIdle() { ThePool().CloseIdle(); }
 
 int OvDBExecute(const std::string& sql, DBResult_tag** result) {
@@ -192,7 +273,7 @@ std::string OvDBEscapeString(const std::string& text) {
     std::string out(text.size() * 2 + 1, '\0');
     size_t n;
     {
-        Lease lease;
+        Lease lease(Clock::now() + std::chrono::milliseconds(statementTimeoutMs.load()));
         if (lease.get()) {
             int error = 0;
             n = PQescapeStringConn(lease.get(), &out[0], text.data(), text.size(), &error);

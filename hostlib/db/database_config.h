@@ -8,13 +8,20 @@
 //
 // Connection settings come from the standard libpq environment (PGHOST,
 // PGPORT, PGDATABASE, PGUSER, PGPASSWORD, PGSSLMODE, ...) unless the host sets
-// a conninfo string first. Every connection uses client_encoding UTF8 and,
-// unless the settings say otherwise, a connect timeout of 10 seconds.
+// a conninfo string first. Every connection uses client_encoding UTF8.
 //
 // A broken connection (the server restarted or dropped it) is found before a
 // statement is sent and reset then, so the next statement works once the
 // server is back. A statement whose connection breaks while it runs fails and
-// is not sent again: it may have been executed.
+// is not sent again. Several statements in one string run as one
+// transaction: a connection lost midway commits none of them.
+//
+// Every statement is bounded in time: from the wait for a free connection to
+// its last result it may take the statement timeout (15 s by default), and
+// fails when the server does not answer by then (a stalled or unreachable
+// server never holds a host thread). Its connection is then closed. A
+// statement given up this way may still complete on the server if it resumes
+// (a transaction commits whole or not at all).
 #ifndef HOSTLIB_DATABASE_CONFIG_H
 #define HOSTLIB_DATABASE_CONFIG_H
 
@@ -26,6 +33,9 @@ void HostDBSetConnInfo(const std::string& conninfo);
 
 // Sets the most connections open at once (at least 1; default 8).
 void HostDBSetPoolSize(int size);
+
+// Sets how long one statement may take in all, in milliseconds (default 15000).
+void HostDBSetStatementTimeoutMs(int ms);
 
 // Closes every idle connection (connections in use close when returned).
 void HostDBCloseIdle();

@@ -11,6 +11,7 @@
 #include "common/pg_test_util.h"
 #include "host/camera.h"
 #include "hostlib/db/camera_status.h"
+#include "hostlib/db/database_config.h"
 #include "patrol/patrol.h"
 #include "patrol_pg_lists.h"
 
@@ -347,6 +348,25 @@ TEST_F(PatrolDatabase, ServerRestartOrOutageIsSurvived) {
     EXPECT_EQ(p.Save(), 0);
     EXPECT_EQ(back.Load(p.GetId()), 0);
     EXPECT_EQ(back.GetName(), "after");
+
+    // A stalled server: every statement fails at the timeout, with its
+    // connection or with a new one, instead of waiting for the server.
+    HostDBSetStatementTimeoutMs(300);
+    HostDBSetPoolSize(1);
+    ASSERT_EQ(pgtest::Cluster("stall"), 0);
+    const auto start = std::chrono::steady_clock::now();
+    p.SetName("stalled");
+    EXPECT_EQ(p.Save(), -1);   // times out; its connection is closed
+    EXPECT_EQ(back.Load(p.GetId()), -1);  // a new connection cannot be made either
+    const auto took = std::chrono::steady_clock::now() - start;
+    ASSERT_EQ(pgtest::Cluster("resume"), 0);
+    HostDBSetStatementTimeoutMs(15000);
+    HostDBSetPoolSize(8);
+    EXPECT_LT(took, std::chrono::seconds(3));
+    p.SetName("resumed");
+    EXPECT_EQ(p.Save(), 0);
+    EXPECT_EQ(back.Load(p.GetId()), 0);
+    EXPECT_EQ(back.GetName(), "resumed");
 }
 
 }  // namespace
