@@ -34,7 +34,7 @@ PatrolExecutor::PatrolExecutor()
       thread(),
       threadStarted(false) {
     pthread_mutex_init(&mutex, nullptr);
-    pthread_cond_init(&wake, nullptr);
+    InitWorkerCond(&wake);
     const int rc = StartWorkerThread(&thread, ThreadFuncExcute, this);
     threadStarted = (rc == 0);
     if (!threadStarted) EXECUTOR_LOG("Create worker thread failed: %d.", rc);
@@ -167,7 +167,7 @@ int PatrolExecutor::ChangeExcutePatrol(Patrol& patrol) {
 }
 
 int PatrolExecutor::ExcuteMain() {
-    DelayTimer pacer(kPassMicros);
+    WorkerPacer pacer(kPassMicros);
     TimeCount stayCount;
     Patrol loadedPatrol;
     int presetIndex = 0;
@@ -229,8 +229,10 @@ int PatrolExecutor::ExcuteMain() {
                 break;
         }
 
-        EndWorkerPass(&mutex, &wake, pacer,
-                      [this] { return command == PATROL_CMD_NONE && status.load() == PATROL_STATUS_IDLE; });
+        EndWorkerPass(
+            &mutex, &wake, pacer,
+            [this] { return command == PATROL_CMD_NONE && status.load() == PATROL_STATUS_IDLE; },
+            [this] { return command == PATROL_CMD_EXIT; });
     }
 }
 

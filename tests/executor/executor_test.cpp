@@ -7,10 +7,12 @@
 
 #include <algorithm>
 #include <atomic>
+#include <functional>
 #include <memory>
 #include <thread>
 #include <tuple>
 
+#include "common/worker_thread.h"
 #include "executor/guardExecutor.h"
 #include "executor/patrolExecutor.h"
 #include "fake/fake_host.h"
@@ -20,7 +22,7 @@
 struct GuardExecutorPeer {
     static void PrepareWithoutThread(GuardExecutor& g) {
         pthread_mutex_init(&g.mutex, nullptr);
-        pthread_cond_init(&g.wake, nullptr);
+        InitWorkerCond(&g.wake);
         g.started = true;
     }
     static void StartThread(GuardExecutor& g) {
@@ -212,16 +214,80 @@ TEST_F(ExecutorTest, DestructionDuringARunMakesNoFurtherMove) {
     EXPECT_LE(stack.load(), 1024u * 1024u);
 }
 
-TEST(DelayTimer, PassesKeepToTheirGridWithoutDrift) {
-    DelayTimer pacer(50000);
-    const auto start = Clock::now();
-    pacer.BeginTiming();
-    for (int pass = 0; pass < 10; ++pass) {
-        std::this_thread::sleep_for(30ms);  // the work of a pass
-        pacer.Delay();
+// Right after the pass that began a wait (a stay; a pause; a hold-off) the
+// next pass is nearly a period away: the destructor and Terminate do not wait
+// for it.
+TEST_F(ExecutorTest, DestroyAndTerminateDoNotWaitForTheNextPass) {
+    StorePatrol(120, 1, 60, {1, 2});
+    StorePatrol(121, 1, 0, {3});
+    auto own = std::make_unique<PatrolExecutor>();
+    own->Execute(120, PATROL_EXEC_DIRECT);
+    ASSERT_TRUE(WaitForMoves(1));
+    auto t0 = Clock::now();
+    own.reset();  // in a 60 s stay
+    EXPECT_LT(Since(t0), 0.125);
+    EXPECT_EQ(fake::Moves(), MovesTo({1}));
+
+    // Continuous mode pauses after its one run; a switch to off holds off.
+    for (int state : {GUARD_STATE_INTERVAL, GUARD_STATE_HOLDOFF}) {
+        SCOPED_TRACE(state);
+        GuardExecutor g{2};
+        ASSERT_EQ(g.Init(&executor, 1, 1, 10), 0);
+        g.AnalyzeSchedule({}, {}, {121, GUARD_MODE_CONTINUOUS});
+        ASSERT_TRUE(fake::WaitFor([&] { return Peer::State(g) == GUARD_STATE_RUNNING; }, 1s));
+        if (state == GUARD_STATE_HOLDOFF) g.AnalyzeSchedule({}, {}, {121, GUARD_MODE_OFF});
+        ASSERT_TRUE(fake::WaitFor([&] { return Peer::State(g) == state; }, 3000ms));
+        t0 = Clock::now();
+        EXPECT_EQ(g.Terminate(), 0);
+        EXPECT_LT(Since(t0), 0.125);
     }
-    EXPECT_GE(Since(start), 0.5 - 0.005);  // ten periods, not ten periods plus the work
-    EXPECT_LT(Since(start), 0.5 + 0.2);
+}
+
+// Passes keep to their grid without drift, also while other posts signal the
+// condition variable; after an overrun of more than a period the grid
+// restarts from now. The library's pacer and the host's DelayTimer alike.
+TEST(Pacing, PassesKeepToTheirGridAndRestartAfterAnOverrun) {
+    pthread_mutex_t mutex = PTHREAD_MUTEX_INITIALIZER;
+    pthread_cond_t wake;
+    InitWorkerCond(&wake);
+    std::atomic<bool> done{false};
+    std::thread poster([&] {  // posts that are not an exit
+        while (!done) {
+            pthread_cond_signal(&wake);
+            std::this_thread::sleep_for(5ms);
+        }
+    });
+    WorkerPacer pacer(50000);
+    DelayTimer host(50000);
+    const auto waitPacer = [&] {
+        pthread_mutex_lock(&mutex);
+        pacer.WaitNext(&mutex, &wake, [] { return false; });
+        pthread_mutex_unlock(&mutex);
+    };
+    const std::pair<std::function<void()>, std::function<void()>> timers[] = {
+        {[&] { pacer.BeginTiming(); }, waitPacer},
+        {[&] { host.BeginTiming(); }, [&] { host.Delay(); }},
+    };
+    for (const auto& [begin, wait] : timers) {
+        const auto start = Clock::now();
+        begin();
+        for (int pass = 0; pass < 10; ++pass) {
+            std::this_thread::sleep_for(30ms);  // the work of a pass
+            wait();
+        }
+        EXPECT_GE(Since(start), 0.5 - 0.005);  // ten periods, not ten periods plus the work
+        EXPECT_LT(Since(start), 0.5 + 0.2);
+        std::this_thread::sleep_for(130ms);  // a pass overruns by more than a period
+        auto t = Clock::now();
+        wait();
+        EXPECT_LT(Since(t), 0.045);  // the next pass at once
+        t = Clock::now();
+        wait();
+        EXPECT_GE(Since(t), 0.05 - 0.005);  // then a period later, not a burst
+    }
+    done = true;
+    poster.join();
+    pthread_cond_destroy(&wake);
 }
 
 // An event status `ageSeconds` old (negative: in the future).
