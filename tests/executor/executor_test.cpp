@@ -9,6 +9,7 @@
 #include <atomic>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <thread>
 #include <tuple>
 
@@ -212,6 +213,67 @@ TEST_F(ExecutorTest, DestructionDuringARunMakesNoFurtherMove) {
     EXPECT_EQ(fake::ApisOutstanding(), 0);
     EXPECT_GT(stack.load(), 0u);
     EXPECT_LE(stack.load(), 1024u * 1024u);
+}
+
+// The executor is destroyed while its worker is in a slow call (300 ms): the
+// destructor returns as soon as that call has, and no further load or move
+// is begun.
+TEST_F(ExecutorTest, DestructionDuringASlowCallBeginsNoFurtherCall) {
+    enum Where { kPresetRead, kClosingMove, kFailingDirectLoad };
+    struct Case {
+        const char* name;
+        Where where;
+        std::vector<int> moves;
+        int guardLoads;
+    };
+    const Case cases[] = {
+        {"the preset read of a load: no first move", kPresetRead, {}, 0},
+        {"the closing move of a run: the guard request is not loaded", kClosingMove, {4, 4}, 0},
+        {"a failing direct load: the guard patrol is not loaded again", kFailingDirectLoad, {6}, 1},
+    };
+    std::atomic<bool> entered{false};
+    Clock::time_point returned;  // written by the worker, read after the join
+    std::atomic<int> moves{0};
+    const Case* now = nullptr;
+    const auto slow = [&](Where where) {
+        if (now->where != where) return;
+        entered = true;
+        std::this_thread::sleep_for(300ms);
+        returned = Clock::now();
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        fake::Reset();
+        now = &c;
+        entered = false;
+        moves = 0;
+        StorePatrol(30, 1, 0, {4});   // the direct patrol
+        StorePatrol(31, 1, 60, {6});  // the guard patrol
+        fake::OnGetPresetList([&] { slow(kPresetRead); });
+        fake::OnGoPreset([&](int, const std::string&) {
+            if (++moves == 2) slow(kClosingMove);
+        });
+        fake::OnSqlHandler([&](const std::string& sql) -> std::optional<fake::Answer> {
+            if (sql.find("WHERE id = 99;") != sql.npos) slow(kFailingDirectLoad);
+            return std::nullopt;
+        });
+        auto own = std::make_unique<PatrolExecutor>();
+        if (c.where == kFailingDirectLoad) {
+            own->Execute(31, PATROL_EXEC_GUARD);
+            ASSERT_TRUE(WaitForMoves(1));
+            own->Execute(99, PATROL_EXEC_DIRECT);  // no such patrol
+        } else {
+            own->Execute(30, PATROL_EXEC_DIRECT);
+            own->Execute(31, PATROL_EXEC_GUARD);  // waits behind the direct run
+        }
+        ASSERT_TRUE(fake::WaitFor([&] { return entered.load(); }, 2000ms));
+        own.reset();
+        EXPECT_LT(std::chrono::duration<double>(Clock::now() - returned).count(), 0.125);
+        EXPECT_EQ(fake::Moves(), MovesTo(c.moves));
+        EXPECT_EQ(Loads(31), c.guardLoads);
+        EXPECT_EQ(fake::ApisOutstanding(), 0);
+        EXPECT_EQ(fake::ResultsOutstanding(), 0);
+    }
 }
 
 // Right after the pass that began a wait (a stay; a pause; a hold-off) the
