@@ -51,7 +51,7 @@ int GuardExecutor::Init(PatrolExecutor* executor, int repeatCount, int pauseMinu
     this->pauseMinutes = pauseMinutes;
     this->eventValidSeconds = eventValidSeconds;
     pthread_mutex_init(&mutex, nullptr);
-    pthread_cond_init(&wake, nullptr);
+    InitWorkerCond(&wake);
     started = true;
     const int rc = StartWorkerThread(&thread, ThreadFuncExcute, this);
     if (rc != 0) {
@@ -150,7 +150,7 @@ int GuardExecutor::DestroyLock(pthread_mutex_t* lock) {
 }
 
 int GuardExecutor::ExcuteMain() {
-    DelayTimer pacer(kPassMicros);
+    WorkerPacer pacer(kPassMicros);
     TimeCount guardTimer;
     int runCount = 0;
     pacer.BeginTiming();
@@ -222,7 +222,9 @@ int GuardExecutor::ExcuteMain() {
                 break;
         }
 
-        EndWorkerPass(&mutex, &wake, pacer,
-                      [this] { return command == GUARD_CMD_NONE && state.load() == GUARD_STATE_IDLE; });
+        EndWorkerPass(
+            &mutex, &wake, pacer,
+            [this] { return command == GUARD_CMD_NONE && state.load() == GUARD_STATE_IDLE; },
+            [this] { return command == GUARD_CMD_TERMINATE; });
     }
 }

@@ -69,8 +69,9 @@ public:
     // Judges the schedule entry in force and the two events, and posts START
     // or STOP when the command slot is empty.
     void AnalyzeSchedule(EVENT_STATUS first, EVENT_STATUS second, GuardScheduleInfo info);
-    // Ends and joins the guard thread within one pass; a tour in progress on
-    // the executor runs on. 0: done; -1: the thread was not running.
+    // Ends and joins the guard thread at once (also during a pause or
+    // hold-off); a tour in progress on the executor runs on. 0: done; -1: the
+    // thread was not running.
     int Terminate();
 
 private:
@@ -101,7 +102,8 @@ private:
     // nothing called inside, never nested with the executor's mutex.
     pthread_mutex_t mutex;
     // Signalled after each post; the thread, idle with no command, sleeps on
-    // it (with mutex) instead of making empty passes.
+    // it (with mutex) instead of making empty passes, and otherwise waits on it
+    // for its next pass, so that TERMINATE wakes it. Times on CLOCK_MONOTONIC.
     pthread_cond_t wake;
     bool started;  // Init started the thread and Terminate has not joined it (host threads)
 };

@@ -34,7 +34,7 @@ PatrolExecutor::PatrolExecutor()
       thread(),
       threadStarted(false) {
     pthread_mutex_init(&mutex, nullptr);
-    pthread_cond_init(&wake, nullptr);
+    InitWorkerCond(&wake);
     const int rc = StartWorkerThread(&thread, ThreadFuncExcute, this);
     threadStarted = (rc == 0);
     if (!threadStarted) EXECUTOR_LOG("Create worker thread failed: %d.", rc);
@@ -93,6 +93,13 @@ void PatrolExecutor::ResetCommand() {
     pthread_mutex_unlock(&mutex);
 }
 
+bool PatrolExecutor::ExitPosted() {
+    pthread_mutex_lock(&mutex);
+    const bool posted = command == PATROL_CMD_EXIT;
+    pthread_mutex_unlock(&mutex);
+    return posted;
+}
+
 void PatrolExecutor::GetExcutePatrolId(int& patrolId, PATROL_EXEC_TYPE& type) {
     pthread_mutex_lock(&mutex);
     if (requestId[PATROL_EXEC_DIRECT] != 0) {
@@ -136,7 +143,9 @@ int PatrolExecutor::ChangeExcutePatrol(Patrol& patrol) {
             if (patrol.Load(patrolId) != 0) {
                 EXECUTOR_LOG("Load patrol %d failure.", patrolId);
                 result = -1;
-                if (type == PATROL_EXEC_DIRECT) {
+                // Once an exit is posted no further load begins: the failed
+                // direct request is consumed below and the executor is idle.
+                if (type == PATROL_EXEC_DIRECT && !ExitPosted()) {
                     ClearPatrolData(patrolId, PATROL_EXEC_DIRECT);
                     // The run in progress was given up when this load began. A
                     // guard request naming it is served like any other: loaded
@@ -167,16 +176,21 @@ int PatrolExecutor::ChangeExcutePatrol(Patrol& patrol) {
 }
 
 int PatrolExecutor::ExcuteMain() {
-    DelayTimer pacer(kPassMicros);
+    WorkerPacer pacer(kPassMicros);
     TimeCount stayCount;
     Patrol loadedPatrol;
     int presetIndex = 0;
     bool tourDone = false;
     pacer.BeginTiming();
 
+    // An exit posted during a load (database and camera calls) or a move is
+    // seen before the next of them begins: no move after a load, no load
+    // after a run ends.
+    //
     // First move of the run that ChangeExcutePatrol has just loaded; a failed
-    // move ends the run at once.
+    // move ends the run at once. False when no move was made.
     auto startRun = [&]() {
+        if (ExitPosted()) return false;
         InitExecParam(tourDone, presetIndex, stayCount, loadedPatrol.GetStayTime());
         if (ExecPatrol(loadedPatrol, presetIndex, tourDone) == 0) {
             stayCount.BeginCountFromNow();
@@ -187,7 +201,7 @@ int PatrolExecutor::ExcuteMain() {
     };
     // After a run ended: one attempt at the request that is left, if any.
     auto startNext = [&]() {
-        if (ChangeExcutePatrol(loadedPatrol) == 0) startRun();
+        if (!ExitPosted() && ChangeExcutePatrol(loadedPatrol) == 0) startRun();
     };
 
     for (;;) {
@@ -229,8 +243,10 @@ int PatrolExecutor::ExcuteMain() {
                 break;
         }
 
-        EndWorkerPass(&mutex, &wake, pacer,
-                      [this] { return command == PATROL_CMD_NONE && status.load() == PATROL_STATUS_IDLE; });
+        EndWorkerPass(
+            &mutex, &wake, pacer,
+            [this] { return command == PATROL_CMD_NONE && status.load() == PATROL_STATUS_IDLE; },
+            [this] { return command == PATROL_CMD_EXIT; });
     }
 }
 

@@ -49,7 +49,9 @@ public:
     // Starts the worker thread. If the thread cannot be created (logged), the
     // executor stays idle and accepts requests that nothing serves.
     PatrolExecutor();
-    // Stops and joins the worker (after the camera call in progress, if any).
+    // Stops and joins the worker: at once between passes and during a stay;
+    // else as soon as the load of a patrol or the move in progress returns
+    // (no further load or move is begun).
     ~PatrolExecutor();
     PatrolExecutor(const PatrolExecutor&) = delete;
     PatrolExecutor& operator=(const PatrolExecutor&) = delete;
@@ -72,6 +74,8 @@ private:
     // -1 for null, else 0.
     int DestroyLock(pthread_mutex_t* lock);
     void ResetCommand();
+    // Whether the destructor has posted EXIT (read under mutex).
+    bool ExitPosted();
     // The request to serve: direct first, then guard, else (0, NONE).
     void GetExcutePatrolId(int& patrolId, PATROL_EXEC_TYPE& type);
     // Empties the slot of `type` if it still holds `patrolId`.
@@ -100,7 +104,8 @@ private:
     // called while it is held.
     pthread_mutex_t mutex;
     // Signalled after each post; an idle worker with no command sleeps on it
-    // (with mutex) instead of making empty passes.
+    // (with mutex) instead of making empty passes, and a running one waits on
+    // it for its next pass, so that EXIT wakes it. Times on CLOCK_MONOTONIC.
     pthread_cond_t wake;
     // Whether pthread_create succeeded (the destructor joins only a started
     // worker). Set by the constructor only.

@@ -25,6 +25,9 @@ private:
 
 // Paces a loop: passes start one period apart, on a fixed grid of absolute
 // deadlines, so a pass that takes a while does not shift the ones after it.
+// The library's worker loops pace themselves instead (WorkerPacer in
+// common/worker_thread.h): Delay cannot be woken, so a loop sleeping in it
+// would hold up the shutdown of its executor.
 class DelayTimer {
 public:
     explicit DelayTimer(int periodMicroseconds);

@@ -6,7 +6,11 @@
 //    same run (the load of the patrol and one camera call); the goal is at
 //    most one 250 ms pass beyond them;
 //  - Guards/256: 256 guards bound to 256 executors, idle, then in continuous
-//    mode on a patrol whose camera refuses connections.
+//    mode on a patrol whose camera refuses connections;
+//  - StopBusyPairs/256: 256 guards in continuous mode, each running its
+//    executor's patrol on the simulator (all in a stay), stopped one pair
+//    after another as a host does (Terminate the guard, then destroy the
+//    executor); the goal is under 1 s in total.
 // The patrol store is the cluster of scripts/bench.sh, or a throwaway one
 // started here (scripts/pg_cluster.sh); the camera is the simulator of the
 // tests. Run: scripts/bench.sh executor_bench
@@ -296,9 +300,66 @@ void BM_Guards(benchmark::State& state) {
     }
 }
 
+void BM_StopBusyPairs(benchmark::State& state) {
+    World& world = World::Get();
+    if (!world.Ok()) {
+        state.SkipWithError("no PostgreSQL cluster or simulator");
+        return;
+    }
+    const int n = static_cast<int>(state.range(0));
+    const int camId = 9003;
+    onvif::SetCallTimeoutMs(5000);
+    world.AddCamera(camId, world.Sim().Port());
+    const int id = world.StorePatrol(camId, 600, {5, 2, 9});  // a long stay at the first preset
+
+    for (auto _ : state) {
+        std::vector<std::unique_ptr<PatrolExecutor>> executors;
+        std::vector<std::unique_ptr<GuardExecutor>> guards;
+        for (int i = 0; i < n; ++i) {
+            executors.push_back(std::make_unique<PatrolExecutor>());
+            guards.push_back(std::make_unique<GuardExecutor>(i));
+            guards.back()->Init(executors.back().get(), 0, 1, 10);
+        }
+        world.Sim().ClearMoves();
+        const EVENT_STATUS none{};
+        for (auto& g : guards) g->AnalyzeSchedule(none, none, {id, GUARD_MODE_CONTINUOUS});
+        // Every executor has made its first move and is in its stay.
+        const auto deadline = Clock::now() + 60s;
+        while (world.Sim().Moves().size() < static_cast<size_t>(n) && Clock::now() < deadline) {
+            std::this_thread::sleep_for(20ms);
+        }
+        int running = 0;
+        for (auto& e : executors) running += e->GetStatus() == PATROL_STATUS_RUNNING;
+        std::this_thread::sleep_for(1s);  // the guards past their wait after Execute
+
+        std::vector<double> pairs;
+        const auto t0 = Clock::now();
+        for (int i = 0; i < n; ++i) {
+            const auto p0 = Clock::now();
+            guards[i]->Terminate();
+            executors[i].reset();
+            pairs.push_back(std::chrono::duration<double, std::milli>(Clock::now() - p0).count());
+        }
+        const double totalMs = std::chrono::duration<double, std::milli>(Clock::now() - t0).count();
+        guards.clear();
+        if (running != n) {
+            state.SkipWithError("not every executor was running its patrol");
+            return;
+        }
+        double mean = 0;
+        for (double p : pairs) mean += p;
+        mean /= n;
+        state.counters["stop_total_ms"] = totalMs;
+        state.counters["stop_mean_ms_per_pair"] = mean;
+        state.counters["stop_max_ms_per_pair"] = *std::max_element(pairs.begin(), pairs.end());
+        state.counters["stop_total_vs_goal_1s"] = totalMs / 1000;  // at most 1 meets the goal
+    }
+}
+
 BENCHMARK(BM_IdleExecutors)->Arg(500)->Iterations(1)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_ExecuteToFirstMove)->Iterations(1)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_Guards)->Arg(256)->Iterations(1)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_StopBusyPairs)->Arg(256)->Iterations(1)->Unit(benchmark::kMillisecond);
 
 }  // namespace
 

@@ -7,10 +7,13 @@
 
 #include <algorithm>
 #include <atomic>
+#include <functional>
 #include <memory>
+#include <optional>
 #include <thread>
 #include <tuple>
 
+#include "common/worker_thread.h"
 #include "executor/guardExecutor.h"
 #include "executor/patrolExecutor.h"
 #include "fake/fake_host.h"
@@ -20,7 +23,7 @@
 struct GuardExecutorPeer {
     static void PrepareWithoutThread(GuardExecutor& g) {
         pthread_mutex_init(&g.mutex, nullptr);
-        pthread_cond_init(&g.wake, nullptr);
+        InitWorkerCond(&g.wake);
         g.started = true;
     }
     static void StartThread(GuardExecutor& g) {
@@ -212,16 +215,141 @@ TEST_F(ExecutorTest, DestructionDuringARunMakesNoFurtherMove) {
     EXPECT_LE(stack.load(), 1024u * 1024u);
 }
 
-TEST(DelayTimer, PassesKeepToTheirGridWithoutDrift) {
-    DelayTimer pacer(50000);
-    const auto start = Clock::now();
-    pacer.BeginTiming();
-    for (int pass = 0; pass < 10; ++pass) {
-        std::this_thread::sleep_for(30ms);  // the work of a pass
-        pacer.Delay();
+// The executor is destroyed while its worker is in a slow call (300 ms): the
+// destructor returns as soon as that call has, and no further load or move
+// is begun.
+TEST_F(ExecutorTest, DestructionDuringASlowCallBeginsNoFurtherCall) {
+    enum Where { kPresetRead, kClosingMove, kFailingDirectLoad };
+    struct Case {
+        const char* name;
+        Where where;
+        std::vector<int> moves;
+        int guardLoads;
+    };
+    const Case cases[] = {
+        {"the preset read of a load: no first move", kPresetRead, {}, 0},
+        {"the closing move of a run: the guard request is not loaded", kClosingMove, {4, 4}, 0},
+        {"a failing direct load: the guard patrol is not loaded again", kFailingDirectLoad, {6}, 1},
+    };
+    std::atomic<bool> entered{false};
+    Clock::time_point returned;  // written by the worker, read after the join
+    std::atomic<int> moves{0};
+    const Case* now = nullptr;
+    const auto slow = [&](Where where) {
+        if (now->where != where) return;
+        entered = true;
+        std::this_thread::sleep_for(300ms);
+        returned = Clock::now();
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        fake::Reset();
+        now = &c;
+        entered = false;
+        moves = 0;
+        StorePatrol(30, 1, 0, {4});   // the direct patrol
+        StorePatrol(31, 1, 60, {6});  // the guard patrol
+        fake::OnGetPresetList([&] { slow(kPresetRead); });
+        fake::OnGoPreset([&](int, const std::string&) {
+            if (++moves == 2) slow(kClosingMove);
+        });
+        fake::OnSqlHandler([&](const std::string& sql) -> std::optional<fake::Answer> {
+            if (sql.find("WHERE id = 99;") != sql.npos) slow(kFailingDirectLoad);
+            return std::nullopt;
+        });
+        auto own = std::make_unique<PatrolExecutor>();
+        if (c.where == kFailingDirectLoad) {
+            own->Execute(31, PATROL_EXEC_GUARD);
+            ASSERT_TRUE(WaitForMoves(1));
+            own->Execute(99, PATROL_EXEC_DIRECT);  // no such patrol
+        } else {
+            own->Execute(30, PATROL_EXEC_DIRECT);
+            own->Execute(31, PATROL_EXEC_GUARD);  // waits behind the direct run
+        }
+        ASSERT_TRUE(fake::WaitFor([&] { return entered.load(); }, 2000ms));
+        own.reset();
+        EXPECT_LT(std::chrono::duration<double>(Clock::now() - returned).count(), 0.125);
+        EXPECT_EQ(fake::Moves(), MovesTo(c.moves));
+        EXPECT_EQ(Loads(31), c.guardLoads);
+        EXPECT_EQ(fake::ApisOutstanding(), 0);
+        EXPECT_EQ(fake::ResultsOutstanding(), 0);
     }
-    EXPECT_GE(Since(start), 0.5 - 0.005);  // ten periods, not ten periods plus the work
-    EXPECT_LT(Since(start), 0.5 + 0.2);
+}
+
+// Right after the pass that began a wait (a stay; a pause; a hold-off) the
+// next pass is nearly a period away: the destructor and Terminate do not wait
+// for it.
+TEST_F(ExecutorTest, DestroyAndTerminateDoNotWaitForTheNextPass) {
+    StorePatrol(120, 1, 60, {1, 2});
+    StorePatrol(121, 1, 0, {3});
+    auto own = std::make_unique<PatrolExecutor>();
+    own->Execute(120, PATROL_EXEC_DIRECT);
+    ASSERT_TRUE(WaitForMoves(1));
+    auto t0 = Clock::now();
+    own.reset();  // in a 60 s stay
+    EXPECT_LT(Since(t0), 0.125);
+    EXPECT_EQ(fake::Moves(), MovesTo({1}));
+
+    // Continuous mode pauses after its one run; a switch to off holds off.
+    for (int state : {GUARD_STATE_INTERVAL, GUARD_STATE_HOLDOFF}) {
+        SCOPED_TRACE(state);
+        GuardExecutor g{2};
+        ASSERT_EQ(g.Init(&executor, 1, 1, 10), 0);
+        g.AnalyzeSchedule({}, {}, {121, GUARD_MODE_CONTINUOUS});
+        ASSERT_TRUE(fake::WaitFor([&] { return Peer::State(g) == GUARD_STATE_RUNNING; }, 1s));
+        if (state == GUARD_STATE_HOLDOFF) g.AnalyzeSchedule({}, {}, {121, GUARD_MODE_OFF});
+        ASSERT_TRUE(fake::WaitFor([&] { return Peer::State(g) == state; }, 3000ms));
+        t0 = Clock::now();
+        EXPECT_EQ(g.Terminate(), 0);
+        EXPECT_LT(Since(t0), 0.125);
+    }
+}
+
+// Passes keep to their grid without drift, also while other posts signal the
+// condition variable; after an overrun of more than a period the grid
+// restarts from now. The library's pacer and the host's DelayTimer alike.
+TEST(Pacing, PassesKeepToTheirGridAndRestartAfterAnOverrun) {
+    pthread_mutex_t mutex = PTHREAD_MUTEX_INITIALIZER;
+    pthread_cond_t wake;
+    InitWorkerCond(&wake);
+    std::atomic<bool> done{false};
+    std::thread poster([&] {  // posts that are not an exit
+        while (!done) {
+            pthread_cond_signal(&wake);
+            std::this_thread::sleep_for(5ms);
+        }
+    });
+    WorkerPacer pacer(50000);
+    DelayTimer host(50000);
+    const auto waitPacer = [&] {
+        pthread_mutex_lock(&mutex);
+        pacer.WaitNext(&mutex, &wake, [] { return false; });
+        pthread_mutex_unlock(&mutex);
+    };
+    const std::pair<std::function<void()>, std::function<void()>> timers[] = {
+        {[&] { pacer.BeginTiming(); }, waitPacer},
+        {[&] { host.BeginTiming(); }, [&] { host.Delay(); }},
+    };
+    for (const auto& [begin, wait] : timers) {
+        const auto start = Clock::now();
+        begin();
+        for (int pass = 0; pass < 10; ++pass) {
+            std::this_thread::sleep_for(30ms);  // the work of a pass
+            wait();
+        }
+        EXPECT_GE(Since(start), 0.5 - 0.005);  // ten periods, not ten periods plus the work
+        EXPECT_LT(Since(start), 0.5 + 0.2);
+        std::this_thread::sleep_for(130ms);  // a pass overruns by more than a period
+        auto t = Clock::now();
+        wait();
+        EXPECT_LT(Since(t), 0.045);  // the next pass at once
+        t = Clock::now();
+        wait();
+        EXPECT_GE(Since(t), 0.05 - 0.005);  // then a period later, not a burst
+    }
+    done = true;
+    poster.join();
+    pthread_cond_destroy(&wake);
 }
 
 // An event status `ageSeconds` old (negative: in the future).

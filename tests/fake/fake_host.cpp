@@ -32,6 +32,7 @@ struct State {
     std::vector<std::string> moves;
     int apisOutstanding = 0;
     std::function<void(int, const std::string&)> goPresetHook;
+    std::function<void()> presetListHook;
 
     std::vector<LogLine> logs;
 };
@@ -82,6 +83,12 @@ public:
     }
     int GetPresetList(std::map<int, std::string>& presets) override {
         Record("GetPresetList");
+        std::function<void()> hook;
+        {
+            std::lock_guard<std::mutex> lock(S().mu);
+            hook = S().presetListHook;
+        }
+        if (hook) hook();
         std::lock_guard<std::mutex> lock(S().mu);
         const FakeCameraHost& h = S().hosts[host_];
         if (h.presetListRc == 0) presets = h.presets;
@@ -178,6 +185,11 @@ void OnGoPreset(std::function<void(int, const std::string&)> hook) {
     S().goPresetHook = std::move(hook);
 }
 
+void OnGetPresetList(std::function<void()> hook) {
+    std::lock_guard<std::mutex> lock(S().mu);
+    S().presetListHook = std::move(hook);
+}
+
 std::vector<LogLine> Logs() {
     std::lock_guard<std::mutex> lock(S().mu);
     return S().logs;
@@ -206,6 +218,7 @@ void Reset() {
         s.moves.clear();
         s.apisOutstanding = 0;
         s.goPresetHook = nullptr;
+        s.presetListHook = nullptr;
         s.logs.clear();
     }
     for (auto& hook : ResetHooks()) hook();

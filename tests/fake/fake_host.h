@@ -76,6 +76,8 @@ int ApisOutstanding();                       // control objects made minus relea
 
 // Runs inside every GoPreset before it answers (e.g. to block or count).
 void OnGoPreset(std::function<void(int position, const std::string& name)> hook);
+// Runs inside every GetPresetList before it answers.
+void OnGetPresetList(std::function<void()> hook);
 
 // ---- syslog ----
 
