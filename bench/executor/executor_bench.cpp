@@ -32,6 +32,7 @@
 #include <thread>
 #include <vector>
 
+#include "bench_result.h"
 #include "executor/guardExecutor.h"
 #include "executor/patrolExecutor.h"
 #include "host/camera.h"
@@ -175,6 +176,8 @@ void BM_IdleExecutors(benchmark::State& state) {
         state.counters["vm_kib_per_executor"] = double(vm1 - vm0) / n;
         state.counters["default_stack_kib"] = double(DefaultStackBytes()) / 1024;
         state.counters["vm_mib_total_workers"] = double(vm1 - vm0) / 1024;
+        ReportAbsolute("500 idle executors: CPU", 100 * share, "% of a core", "< 1 %");
+        ReportAbsolute("500 idle executors: resident memory each", double(rss1 - rss0) / n, "KiB", "-");
         const auto t0 = Clock::now();
         executors.clear();
         state.counters["destroy_all_ms"] =
@@ -256,6 +259,8 @@ void BM_ExecuteToFirstMove(benchmark::State& state) {
     // What is left for the wait for the worker's pass; the goal is at most
     // one pass (ratio at most 1).
     state.counters["max_wait_vs_pass"] = (delays.back() - loadMs - callMs) / 250.0;
+    ReportAbsolute("Execute to first move: worst wait beyond the load and the call", delays.back() - loadMs - callMs,
+                   "ms", "<= 250 ms (one pass)");
 }
 
 void BM_Guards(benchmark::State& state) {
@@ -281,7 +286,9 @@ void BM_Guards(benchmark::State& state) {
         }
         std::this_thread::sleep_for(500ms);
         const long rss1 = StatusKib("VmRSS"), vm1 = StatusKib("VmSize");
-        state.counters["idle_cpu_pct_of_core"] = 100 * CpuShareOver(10s);
+        const double idle = 100 * CpuShareOver(10s);
+        state.counters["idle_cpu_pct_of_core"] = idle;
+        ReportAbsolute("256 idle guard and executor pairs: CPU", idle, "% of a core", "< 1 %");
         state.counters["rss_kib_per_pair"] = double(rss1 - rss0) / n;
         state.counters["vm_kib_per_pair"] = double(vm1 - vm0) / n;
 
@@ -353,6 +360,7 @@ void BM_StopBusyPairs(benchmark::State& state) {
         state.counters["stop_mean_ms_per_pair"] = mean;
         state.counters["stop_max_ms_per_pair"] = *std::max_element(pairs.begin(), pairs.end());
         state.counters["stop_total_vs_goal_1s"] = totalMs / 1000;  // at most 1 meets the goal
+        ReportAbsolute("Stop 256 busy guard and executor pairs, one after another", totalMs, "ms", "< 1000 ms");
     }
 }
 

@@ -197,4 +197,4 @@ BENCHMARK(GetAll100Bare)->Name("GetAll100/baseline")->Unit(benchmark::kMicroseco
 
 }  // namespace
 
-RATIO_BENCHMARK_MAIN();
+RATIO_BENCHMARK_MAIN({{"SaveLoad32", "<= 1.10"}, {"PartialGetAll100", "<= 1.10"}, {"GetAll100", "<= 1.10"}});
