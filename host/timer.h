@@ -7,6 +7,8 @@
 
 #include <cstdint>
 
+#include "common/ptzpatrol_config.h"  // time_t: the library's width
+
 // Counts a set length from a starting moment.
 class TimeCount {
 public:
