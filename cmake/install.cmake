@@ -7,7 +7,13 @@ include(CMakePackageConfigHelpers)
 set(PTZ_INCLUDE_DIR ${CMAKE_INSTALL_INCLUDEDIR}/ptzpatrol)
 set(PTZ_CMAKE_DIR ${CMAKE_INSTALL_LIBDIR}/cmake/ptzpatrol)
 
-install(TARGETS ptzpatrol ptzhost ptzpatrol_host EXPORT ptzpatrolTargets
+# The library-only build (the cross build for the target) installs the
+# library alone; the host provides the services.
+set(PTZ_INSTALL_TARGETS ptzpatrol)
+if(TARGET ptzhost)
+  list(APPEND PTZ_INSTALL_TARGETS ptzhost ptzpatrol_host)
+endif()
+install(TARGETS ${PTZ_INSTALL_TARGETS} EXPORT ptzpatrolTargets
         LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT runtime NAMELINK_COMPONENT dev)
 
 # Public headers: the library's API, the host services it calls, and the
@@ -15,11 +21,14 @@ install(TARGETS ptzpatrol ptzhost ptzpatrol_host EXPORT ptzpatrolTargets
 foreach(dir host patrol executor snapshot)
   install(DIRECTORY ${dir} DESTINATION ${PTZ_INCLUDE_DIR} COMPONENT dev FILES_MATCHING PATTERN "*.h")
 endforeach()
-install(FILES common/export.h DESTINATION ${PTZ_INCLUDE_DIR}/common COMPONENT dev)
-install(FILES hostlib/db/database_config.h hostlib/db/camera_status.h
-        DESTINATION ${PTZ_INCLUDE_DIR}/hostlib/db COMPONENT dev)
-install(FILES hostlib/camera/onvif_camera.h DESTINATION ${PTZ_INCLUDE_DIR}/hostlib/camera COMPONENT dev)
+install(FILES common/export.h ${PTZ_GENERATED_INCLUDE_DIR}/common/ptzpatrol_config.h
+        DESTINATION ${PTZ_INCLUDE_DIR}/common COMPONENT dev)
 install(FILES hostlib/db/schema.sql DESTINATION ${CMAKE_INSTALL_DATADIR}/ptzpatrol COMPONENT tools)
+if(TARGET ptzhost)
+  install(FILES hostlib/db/database_config.h hostlib/db/camera_status.h
+          DESTINATION ${PTZ_INCLUDE_DIR}/hostlib/db COMPONENT dev)
+  install(FILES hostlib/camera/onvif_camera.h DESTINATION ${PTZ_INCLUDE_DIR}/hostlib/camera COMPONENT dev)
+endif()
 
 # CMake package: find_package(ptzpatrol CONFIG) gives ptzpatrol::ptzpatrol
 # (the library alone) and ptzpatrol::host (our host layer, with the library).
@@ -35,7 +44,14 @@ install(FILES ${CMAKE_BINARY_DIR}/pkg/ptzpatrolConfig.cmake ${CMAKE_BINARY_DIR}/
 # pkg-config files, relocatable: the prefix is found from the file's own place.
 file(RELATIVE_PATH PTZ_PC_TO_PREFIX ${CMAKE_INSTALL_FULL_LIBDIR}/pkgconfig ${CMAKE_INSTALL_PREFIX})
 string(REGEX REPLACE "/$" "" PTZ_PC_TO_PREFIX "${PTZ_PC_TO_PREFIX}")
-foreach(pc ptzpatrol ptzhost)
+# The library's time_t width, for hosts that build with pkg-config.
+list(TRANSFORM PTZ_TIME64_DEFINITIONS PREPEND "-D" OUTPUT_VARIABLE PTZ_PC_DEFINES)
+string(JOIN " " PTZ_PC_DEFINES ${PTZ_PC_DEFINES})
+set(PTZ_PC_FILES ptzpatrol)
+if(TARGET ptzhost)
+  list(APPEND PTZ_PC_FILES ptzhost)
+endif()
+foreach(pc ${PTZ_PC_FILES})
   configure_file(cmake/pkg/${pc}.pc.in ${CMAKE_BINARY_DIR}/pkg/${pc}.pc @ONLY)
   install(FILES ${CMAKE_BINARY_DIR}/pkg/${pc}.pc DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig COMPONENT dev)
 endforeach()

@@ -9,6 +9,7 @@
 #include <atomic>
 
 #include "common/export.h"
+#include "common/ptzpatrol_config.h"  // time_t: the library's width
 #include "executor/patrolExecutor.h"
 
 // The schedule entry in force: which patrol, in which mode.

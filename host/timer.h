@@ -7,6 +7,8 @@
 
 #include <cstdint>
 
+#include "common/ptzpatrol_config.h"  // time_t: the library's width
+
 // Counts a set length from a starting moment.
 class TimeCount {
 public:
@@ -45,7 +47,8 @@ private:
 // Whether a wall-clock timestamp lies within `spanMicroseconds` before now.
 // 1: valid; 0: older than the span, or a negative span. A timestamp in the
 // future by at most one second (clock skew between the event source and this
-// host) counts as valid; further in the future it is not.
+// host) counts as valid; further in the future it is not. 0 as well when the
+// wall clock cannot be read (with a 32-bit time_t: after 2038-01-19).
 int IsTimeStampValid(struct timeval timestamp, int spanMicroseconds);
 
 #endif  // HOST_TIMER_H

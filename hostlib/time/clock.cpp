@@ -14,7 +14,9 @@ constexpr int64_t kFutureToleranceMicros = 1000000;
 int IsTimeStampValid(struct timeval timestamp, int spanMicroseconds) {
     if (spanMicroseconds < 0) return 0;
     struct timeval now;
-    gettimeofday(&now, nullptr);
+    // With a 32-bit time_t the wall clock cannot be read after 2038-01-19
+    // (EOVERFLOW): without a "now" no timestamp can be judged valid.
+    if (gettimeofday(&now, nullptr) != 0) return 0;
     const int64_t nowUs = static_cast<int64_t>(now.tv_sec) * 1000000 + now.tv_usec;
     const int64_t tsUs = static_cast<int64_t>(timestamp.tv_sec) * 1000000 + timestamp.tv_usec;
     const int64_t age = nowUs - tsUs;

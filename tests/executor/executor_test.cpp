@@ -4,12 +4,16 @@
 #include <gtest/gtest.h>
 #include <pthread.h>
 #include <sys/time.h>
+#include <time.h>
 
 #include <algorithm>
 #include <atomic>
+#include <climits>
+#include <cstdlib>
 #include <functional>
 #include <memory>
 #include <optional>
+#include <string>
 #include <thread>
 #include <tuple>
 
@@ -437,6 +441,79 @@ TEST_F(ExecutorTest, RepeatsWithoutEndUntilANewEntryStopsIt) {
     std::this_thread::sleep_for(1500ms);  // longer than one run and the wait after it
     EXPECT_EQ(Loads(250), 3);
     EXPECT_EQ(executor.GetStatus(), PATROL_STATUS_IDLE);
+}
+
+// Wall-clock timestamps past 2038-01-19 03:14:07 UTC, the last second of a
+// 32-bit time_t: with the clock just past it (events stamped either side) and
+// in 2039, an event counts by its age. With a 32-bit time_t the wall clock
+// cannot be read then, and no event counts as present.
+TEST_F(ExecutorTest, EventsStampedPast2038CountByTheirAge) {
+    const bool wide = sizeof(time_t) * CHAR_BIT >= 64;
+    enum { NONE = GUARD_CMD_NONE, START = GUARD_CMD_START };
+    const int64_t moments[] = {int64_t{1} << 31, 2190499200 /* 2039-06-01 */};
+    Peer::PrepareWithoutThread(guard);
+    Peer::Set(guard, GUARD_STATE_IDLE, 10);
+    for (const int64_t moment : moments) {
+        struct timespec real;
+        clock_gettime(CLOCK_REALTIME, &real);
+        const auto shift = std::chrono::seconds(moment) + 500ms -
+                           std::chrono::seconds(real.tv_sec) -
+                           std::chrono::nanoseconds(real.tv_nsec);
+        const fake::ClockShift at(std::chrono::duration_cast<std::chrono::microseconds>(shift),
+                                  0us);
+        struct timeval now;
+        const int rc = gettimeofday(&now, nullptr);
+        if (wide) {
+            ASSERT_TRUE(rc == 0 && now.tv_sec >= moment) << "the clock is not shifted";
+        }
+        // age in seconds (1: before 2^31 s for the first moment), decision
+        const std::pair<double, int> cases[] = {
+            {0.2, START}, {1, START}, {9, START}, {20, NONE}, {-5, NONE}};
+        for (const auto& [age, expected] : cases) {
+            guard.AnalyzeSchedule(Event(1, age), {}, {5, GUARD_MODE_FIRST_EVENT});
+            EXPECT_EQ(Peer::Take(guard).first, wide ? expected : NONE)
+                << "now " << moment << " s + 0.5 s, event " << age << " s old";
+        }
+    }
+    Peer::StartThread(guard);  // for Terminate
+    EXPECT_EQ(guard.Terminate(), 0);
+}
+
+// The timers with the monotonic clock past 2^31 s: a count that crosses it,
+// then a paced loop beyond it.
+TEST(Timers, CountAndPaceAcross2To31SecondsOfTheMonotonicClock) {
+    if (sizeof(time_t) * CHAR_BIT < 64) GTEST_SKIP() << "a 32-bit time_t ends at 2^31 s";
+    struct timespec real;
+    clock_gettime(CLOCK_MONOTONIC, &real);
+    const auto shift = std::chrono::seconds(int64_t{1} << 31) - 100ms -
+                       std::chrono::seconds(real.tv_sec) - std::chrono::nanoseconds(real.tv_nsec);
+    const fake::ClockShift at(0us, std::chrono::duration_cast<std::chrono::microseconds>(shift));
+    struct timespec now;
+    ASSERT_EQ(clock_gettime(CLOCK_MONOTONIC, &now), 0);
+    ASSERT_GE(now.tv_sec, (int64_t{1} << 31) - 1) << "the clock is not shifted";
+
+    TimeCount count;
+    count.SetCountingTime(300000);
+    const auto begun = Clock::now();
+    count.BeginCountFromNow();
+    EXPECT_EQ(count.IsExceed(), 0);
+    ASSERT_TRUE(fake::WaitFor([&] { return count.IsExceed() != 0; }, 2000ms));
+    EXPECT_GE(Since(begun), 0.3 - 0.005);
+
+    DelayTimer pacer(50000);
+    const auto paced = Clock::now();
+    pacer.BeginTiming();
+    for (int pass = 0; pass < 4; ++pass) pacer.Delay();
+    EXPECT_GE(Since(paced), 0.2 - 0.005);
+    EXPECT_LT(Since(paced), 0.2 + 0.2);
+}
+
+// The width of time_t in this build, against the one the caller configured
+// (the cross-build check sets PTZ_EXPECT_TIME_T_BITS).
+TEST(TimeAbi, TimeTHasTheConfiguredWidth) {
+    const char* expected = getenv("PTZ_EXPECT_TIME_T_BITS");
+    if (!expected) GTEST_SKIP() << "time_t: " << sizeof(time_t) * CHAR_BIT << " bits";
+    EXPECT_EQ(std::to_string(sizeof(time_t) * CHAR_BIT), expected);
 }
 
 }  // namespace

@@ -88,6 +88,28 @@ struct LogLine {
 std::vector<LogLine> Logs();
 std::vector<std::string> LogTexts();
 
+// ---- clocks ----
+
+// While alive, what the calling thread reads from the wall clock
+// (gettimeofday, clock_gettime(CLOCK_REALTIME)) and from the monotonic clock
+// (clock_gettime(CLOCK_MONOTONIC)) is shifted by the given amounts, and its
+// absolute sleeps on those clocks (clock_nanosleep with TIMER_ABSTIME) are
+// shifted back: code runs as it would at moments the machine's clocks have not
+// reached (2039, a monotonic clock past 2^31 s). Other threads and relative
+// sleeps are left alone; std::chrono's clocks may or may not follow (the C++
+// library may reach the C library by other names), so only differences of
+// their readings are meaningful meanwhile. A shifted time that does not fit
+// time_t fails as the C library's does (-1, EOVERFLOW), after storing it cut to
+// time_t's width, so code that ignores the failure reads a plausible wrong
+// time. Not nested.
+class ClockShift {
+public:
+    ClockShift(std::chrono::microseconds wall, std::chrono::microseconds monotonic);
+    ~ClockShift();
+    ClockShift(const ClockShift&) = delete;
+    ClockShift& operator=(const ClockShift&) = delete;
+};
+
 // Forgets every rule, record, camera and log line, and runs every hook that
 // other fakes registered with ResetHook.
 void Reset();
