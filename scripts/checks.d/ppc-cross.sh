@@ -23,7 +23,7 @@ cross() {
   cmake -S . -B "$build" -DCMAKE_TOOLCHAIN_FILE=cmake/powerpc-linux-gnu.cmake -DPTZ_LIBRARY_ONLY=ON \
     -DPTZ_TIME64="$time64" -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
   cmake --build "$build" -j"$jobs"
-  file "$build/libptzpatrol.so" | grep -q 'ELF 32-bit MSB.*PowerPC' || { echo "not a 32-bit big-endian PowerPC library" >&2; exit 1; }
+  file -L "$build/libptzpatrol.so" | grep -q 'ELF 32-bit MSB.*PowerPC' || { echo "not a 32-bit big-endian PowerPC library" >&2; exit 1; }
   grep -q "define PTZ_TIME_T_BITS $bits\$" "$build/generated/common/ptzpatrol_config.h" ||
     { echo "ptzpatrol_config.h does not record a $bits-bit time_t" >&2; exit 1; }
   if [ "$bits" = 64 ]; then
