@@ -40,7 +40,7 @@ bool CurlTransfer::Start(const Request& request) {
     if (started_) return false;
     started_ = true;
     timeout_ = std::chrono::seconds(std::max(1, request.timeoutSeconds));
-    headerDeadline_ = Clock::now() + timeout_;
+    deadline_ = Clock::now() + timeout_;
     HostCurlGlobalInit();
 
     curl_ = std::make_unique<Curl>();
@@ -91,7 +91,6 @@ bool CurlTransfer::Start(const Request& request) {
 size_t CurlTransfer::OnHeader(char* data, size_t size, size_t count, void* self) {
     auto* t = static_cast<CurlTransfer*>(self);
     size_t n = size * count;
-    t->progress_ = true;
     const char* end = data + n;
     std::string line = Trim(data, end);
     if (line.compare(0, 5, "HTTP/") == 0) {
@@ -115,7 +114,6 @@ size_t CurlTransfer::OnHeader(char* data, size_t size, size_t count, void* self)
 size_t CurlTransfer::OnBody(char* data, size_t size, size_t count, void* self) {
     auto* t = static_cast<CurlTransfer*>(self);
     size_t n = size * count;
-    t->progress_ = true;
     t->headersDone_ = true;
     // curl hands the same bytes again after a pause, so take all or nothing.
     // With no read waiting (still in the headers), pause at once: curl keeps
@@ -183,9 +181,8 @@ bool CurlTransfer::WaitHeaders() {
             headersDone_ = !failed_;
             break;
         }
-        progress_ = false;
-        if (!Pump(headerDeadline_)) break;
-        if (!headersDone_ && !done_ && Clock::now() >= headerDeadline_) failed_ = true;
+        if (!Pump(deadline_)) break;
+        if (!headersDone_ && !done_ && Clock::now() >= deadline_) failed_ = true;
         if (failed_) break;
     }
     return headersDone_ && !failed_;
@@ -217,11 +214,8 @@ long CurlTransfer::Read(char* dst, size_t size, bool fill) {
         curl_easy_pause(curl_->easy, CURLPAUSE_CONT);  // may deliver the held piece at once
         kick_ = true;
     }
-    Clock::time_point deadline = Clock::now() + timeout_;
     while (targetLeft_ > 0 && (fill || targetLeft_ == size) && !done_ && !failed_) {
-        progress_ = false;
-        if (!Pump(deadline)) break;
-        if (progress_) deadline = Clock::now() + timeout_;
+        if (!Pump(deadline_)) break;
     }
     size_t stored = size - targetLeft_;
     target_ = nullptr;

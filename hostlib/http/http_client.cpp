@@ -125,7 +125,11 @@ MultipartFetch::~MultipartFetch() = default;
 int MultipartFetch::NextPartInfo(unsigned int& length, char* info, unsigned int infoSize) {
     Impl& m = *impl_;
     if (m.failed) return -1;
-    if (!m.parser && !m.Open()) {
+    // The first part's time runs from the connect (Open), each later part's
+    // from this call: a stream may run as long as its parts come in time.
+    if (m.parser) {
+        m.transfer.RestartDeadline();
+    } else if (!m.Open()) {
         m.failed = true;
         return -1;
     }
