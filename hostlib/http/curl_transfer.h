@@ -15,9 +15,10 @@
 #define HOSTLIB_CURL_TRANSFER_H
 
 #include <chrono>
-#include <map>
 #include <memory>
 #include <string>
+
+#include "hostlib/http/response_head.h"
 
 class CurlTransfer {
 public:
@@ -45,9 +46,13 @@ public:
     void RestartDeadline() { deadline_ = Clock::now() + timeout_; }
     // Waits for the final response's headers (after any authentication round).
     bool WaitHeaders();
-    int Status() const { return status_; }
+    int Status() const { return head_.Status(); }
     // Final response header by lower-case name; null when absent.
-    const std::string* Header(const std::string& lowerName) const;
+    const std::string* Header(const std::string& lowerName) const {
+        return head_.Header(lowerName);
+    }
+    // Its Content-Length when that frames the body (see ResponseHead).
+    const std::string* ContentLength() const { return head_.ContentLength(); }
 
     // Reads body bytes into `dst`. With `fill`, returns once `size` bytes are
     // stored, the body has ended, or an error occurred; otherwise once at
@@ -75,8 +80,7 @@ private:
     bool headersDone_ = false;
     bool paused_ = false;
     bool kick_ = false;  // the next Pump runs the transfer without waiting
-    int status_ = 0;
-    std::map<std::string, std::string> headers_;
+    ResponseHead head_;
 
     std::string queue_;      // body bytes received while no read waited for them
     size_t queueHead_ = 0;

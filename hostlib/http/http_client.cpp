@@ -52,9 +52,7 @@ int OvHttpClient::GetHttpContent(HTTP_MAP_KEY key, std::string& value) {
         found = impl_->transfer.Header("content-type");
         break;
     case HTTP_CONTENT_LENGTH:
-        // With a Transfer-Encoding the Content-Length does not delimit the body.
-        if (impl_->transfer.Header("transfer-encoding") == nullptr)
-            found = impl_->transfer.Header("content-length");
+        found = impl_->transfer.ContentLength();
         break;
     }
     if (found == nullptr) return -1;
