@@ -255,18 +255,23 @@ std::optional<time_t> Reply::SystemDateAndTimeUtc() const {
     pugi::xml_node time = Child(utc, kNsSchema, "Time");
     pugi::xml_node date = Child(utc, kNsSchema, "Date");
     if (!time || !date) return std::nullopt;
+    // The fields are checked before any arithmetic: a camera may send any int.
+    const int year = Child(date, kNsSchema, "Year").text().as_int(0);
+    const int month = Child(date, kNsSchema, "Month").text().as_int(0);
     struct tm tm = {};
     tm.tm_hour = Child(time, kNsSchema, "Hour").text().as_int(-1);
     tm.tm_min = Child(time, kNsSchema, "Minute").text().as_int(-1);
     tm.tm_sec = Child(time, kNsSchema, "Second").text().as_int(-1);
-    tm.tm_year = Child(date, kNsSchema, "Year").text().as_int(0) - 1900;
-    tm.tm_mon = Child(date, kNsSchema, "Month").text().as_int(0) - 1;
     tm.tm_mday = Child(date, kNsSchema, "Day").text().as_int(0);
     if (tm.tm_hour < 0 || tm.tm_hour > 23 || tm.tm_min < 0 || tm.tm_min > 59 || tm.tm_sec < 0 ||
-        tm.tm_sec > 60 || tm.tm_year < 70 || tm.tm_mon < 0 || tm.tm_mon > 11 || tm.tm_mday < 1 ||
+        tm.tm_sec > 60 || year < 1970 || year > 9999 || month < 1 || month > 12 || tm.tm_mday < 1 ||
         tm.tm_mday > 31)
         return std::nullopt;
-    return timegm(&tm);
+    tm.tm_year = year - 1900;
+    tm.tm_mon = month - 1;
+    time_t t = timegm(&tm);
+    if (t == static_cast<time_t>(-1)) return std::nullopt;  // beyond time_t (32 bits: after 2038)
+    return t;
 }
 
 Reply::Addresses Reply::Services() const {
