@@ -12,8 +12,11 @@ enum HTTP_MAP_KEY { HTTP_CONTENT_TYPE = 0, HTTP_CONTENT_LENGTH = 1 };
 
 // One HTTP/1.1 request to http://host:port/path, answered with the camera's
 // credentials (Basic or Digest) when the server asks for them.
-// `timeoutSeconds` bounds the connect, each wait for data, and the exchange
-// up to the response headers; a body is read for as long as data keeps coming.
+// `timeoutSeconds` bounds the whole exchange: the connect, the request, the
+// response headers and the body must all have arrived within it from
+// SendRequest. A call that would have to wait past that moment fails instead
+// (CheckResponse -1, ReadData negative), however slowly data still comes, and
+// the exchange is over. No call blocks longer than the timeout.
 class OvHttpClient {
 public:
     OvHttpClient(const std::string& host, int port, const std::string& path,
@@ -39,8 +42,12 @@ private:
 };
 
 // Reader of a multipart/x-mixed-replace stream at http://host:port/path.
-// Keeps at most one part in memory. `timeoutSeconds` bounds the connect and
-// each wait for data.
+// Keeps at most one part in memory. `timeoutSeconds` bounds each part: the
+// first NextPartInfo call (connect, response headers, the part's headers and
+// content) and each later one (the part's headers and content) returns within
+// it from its call, with -1 when the part has not arrived whole by then (the
+// reader is then done), and FetchContent of that part returns by the same
+// moment. A stream runs for as long as its parts come in time.
 class MultipartFetch {
 public:
     MultipartFetch(const char* host, int port, const char* path, const char* username,

@@ -7,7 +7,11 @@
 #include <string.h>
 
 #include <cstdint>
+#include <map>
 #include <pugixml.hpp>
+#include <string_view>
+#include <utility>
+#include <vector>
 
 namespace onvif {
 
@@ -56,37 +60,71 @@ const char* LocalName(const char* name) {
     return colon ? colon + 1 : name;
 }
 
-// The namespace URI of an element: its prefix resolved through the xmlns
-// declarations of the element and its ancestors.
-std::string NamespaceOf(pugi::xml_node node) {
-    const char* name = node.name();
-    const char* colon = strchr(name, ':');
-    std::string attr = colon ? "xmlns:" + std::string(name, colon - name) : std::string("xmlns");
-    for (pugi::xml_node n = node; n; n = n.parent()) {
-        if (n.type() != pugi::node_element) continue;
-        pugi::xml_attribute a = n.attribute(attr.c_str());
-        if (a) return a.value();
+// The namespace declarations of a document, gathered in one walk, so that
+// resolving an element's prefix costs one lookup per ancestor instead of a
+// scan of each ancestor's attributes: a reply with thousands of attributes
+// and thousands of matching elements would otherwise take minutes to read.
+// Names and values point into the document, which must outlive the index.
+class Namespaces {
+public:
+    void Index(const pugi::xml_document& doc) {
+        declared_.clear();
+        for (pugi::xml_node n = doc.first_child(); n;) {
+            if (n.type() == pugi::node_element)
+                for (pugi::xml_attribute a = n.first_attribute(); a; a = a.next_attribute()) {
+                    const char* name = a.name();
+                    if (strncmp(name, "xmlns", 5) != 0 || (name[5] != '\0' && name[5] != ':'))
+                        continue;
+                    // The first declaration of a prefix on an element counts.
+                    declared_.emplace(Key{n.internal_object(), name[5] ? name + 6 : ""}, a.value());
+                }
+            // Depth first, without recursion.
+            if (n.first_child()) {
+                n = n.first_child();
+                continue;
+            }
+            while (n && !n.next_sibling()) n = n.parent();
+            if (n) n = n.next_sibling();
+        }
     }
-    return "";
-}
 
-bool Matches(pugi::xml_node node, const char* ns, const char* local) {
-    return node.type() == pugi::node_element && strcmp(LocalName(node.name()), local) == 0 &&
-           NamespaceOf(node) == ns;
-}
+    // The namespace URI of an element: its prefix resolved through the
+    // declarations of the element and its ancestors; "" when undeclared.
+    const char* Of(pugi::xml_node node) const {
+        const char* name = node.name();
+        const char* colon = strchr(name, ':');
+        std::string_view prefix = colon ? std::string_view(name, colon - name) : std::string_view();
+        for (pugi::xml_node n = node; n; n = n.parent()) {
+            if (n.type() != pugi::node_element) continue;
+            auto it = declared_.find(Key{n.internal_object(), prefix});
+            if (it != declared_.end()) return it->second;
+        }
+        return "";
+    }
 
-pugi::xml_node Child(pugi::xml_node node, const char* ns, const char* local) {
-    for (pugi::xml_node c = node.first_child(); c; c = c.next_sibling())
-        if (Matches(c, ns, local)) return c;
-    return {};
-}
+    bool Matches(pugi::xml_node node, const char* ns, const char* local) const {
+        return node.type() == pugi::node_element && strcmp(LocalName(node.name()), local) == 0 &&
+               strcmp(Of(node), ns) == 0;
+    }
 
-std::vector<pugi::xml_node> Children(pugi::xml_node node, const char* ns, const char* local) {
-    std::vector<pugi::xml_node> out;
-    for (pugi::xml_node c = node.first_child(); c; c = c.next_sibling())
-        if (Matches(c, ns, local)) out.push_back(c);
-    return out;
-}
+    pugi::xml_node Child(pugi::xml_node node, const char* ns, const char* local) const {
+        for (pugi::xml_node c = node.first_child(); c; c = c.next_sibling())
+            if (Matches(c, ns, local)) return c;
+        return {};
+    }
+
+    std::vector<pugi::xml_node> Children(pugi::xml_node node, const char* ns,
+                                         const char* local) const {
+        std::vector<pugi::xml_node> out;
+        for (pugi::xml_node c = node.first_child(); c; c = c.next_sibling())
+            if (Matches(c, ns, local)) out.push_back(c);
+        return out;
+    }
+
+private:
+    using Key = std::pair<const void*, std::string_view>;  // element, prefix ("" default)
+    std::map<Key, const char*> declared_;
+};
 
 std::string Trimmed(const char* text) {
     std::string s = text;
@@ -203,6 +241,7 @@ std::string ActionOf(const std::string& body) {
 
 struct Reply::Impl {
     pugi::xml_document doc;
+    Namespaces names;
     pugi::xml_node body;  // first element of the Body
 };
 
@@ -210,16 +249,18 @@ Reply::Reply() : impl_(new Impl) {}
 Reply::~Reply() { delete impl_; }
 
 bool Reply::Parse(const std::string& text) {
+    const Namespaces& names = impl_->names;
     fault_.reset();
     impl_->body = pugi::xml_node();
     if (!impl_->doc.load_buffer(text.data(), text.size())) return false;
+    impl_->names.Index(impl_->doc);
     pugi::xml_node envelope = impl_->doc.document_element();
     const char* soap = kNsSoap;
-    if (!Matches(envelope, soap, "Envelope")) {
+    if (!names.Matches(envelope, soap, "Envelope")) {
         soap = kNsSoap11;
-        if (!Matches(envelope, soap, "Envelope")) return false;
+        if (!names.Matches(envelope, soap, "Envelope")) return false;
     }
-    pugi::xml_node body = Child(envelope, soap, "Body");
+    pugi::xml_node body = names.Child(envelope, soap, "Body");
     if (!body) return false;
     for (pugi::xml_node c = body.first_child(); c; c = c.next_sibling())
         if (c.type() == pugi::node_element) {
@@ -227,14 +268,14 @@ bool Reply::Parse(const std::string& text) {
             break;
         }
     if (!impl_->body) return false;
-    if (Matches(impl_->body, soap, "Fault")) {
+    if (names.Matches(impl_->body, soap, "Fault")) {
         Fault f;
         pugi::xml_node fault = impl_->body;
         if (soap == kNsSoap) {
-            pugi::xml_node code = Child(fault, soap, "Code");
-            f.code = Text(Child(code, soap, "Value"));
-            f.subcode = Text(Child(Child(code, soap, "Subcode"), soap, "Value"));
-            f.reason = Text(Child(Child(fault, soap, "Reason"), soap, "Text"));
+            pugi::xml_node code = names.Child(fault, soap, "Code");
+            f.code = Text(names.Child(code, soap, "Value"));
+            f.subcode = Text(names.Child(names.Child(code, soap, "Subcode"), soap, "Value"));
+            f.reason = Text(names.Child(names.Child(fault, soap, "Reason"), soap, "Text"));
         } else {  // SOAP 1.1: unqualified children
             f.code = Text(fault.child("faultcode"));
             f.reason = Text(fault.child("faultstring"));
@@ -245,36 +286,44 @@ bool Reply::Parse(const std::string& text) {
 }
 
 bool Reply::Is(const char* ns, const char* local) const {
-    return !fault_ && Matches(impl_->body, ns, local);
+    const Namespaces& names = impl_->names;
+    return !fault_ && names.Matches(impl_->body, ns, local);
 }
 
 std::optional<time_t> Reply::SystemDateAndTimeUtc() const {
+    const Namespaces& names = impl_->names;
     if (!Is(kNsDevice, "GetSystemDateAndTimeResponse")) return std::nullopt;
-    pugi::xml_node utc =
-        Child(Child(impl_->body, kNsDevice, "SystemDateAndTime"), kNsSchema, "UTCDateTime");
-    pugi::xml_node time = Child(utc, kNsSchema, "Time");
-    pugi::xml_node date = Child(utc, kNsSchema, "Date");
+    pugi::xml_node utc = names.Child(names.Child(impl_->body, kNsDevice, "SystemDateAndTime"),
+                                     kNsSchema, "UTCDateTime");
+    pugi::xml_node time = names.Child(utc, kNsSchema, "Time");
+    pugi::xml_node date = names.Child(utc, kNsSchema, "Date");
     if (!time || !date) return std::nullopt;
+    // The fields are checked before any arithmetic: a camera may send any int.
+    const int year = names.Child(date, kNsSchema, "Year").text().as_int(0);
+    const int month = names.Child(date, kNsSchema, "Month").text().as_int(0);
     struct tm tm = {};
-    tm.tm_hour = Child(time, kNsSchema, "Hour").text().as_int(-1);
-    tm.tm_min = Child(time, kNsSchema, "Minute").text().as_int(-1);
-    tm.tm_sec = Child(time, kNsSchema, "Second").text().as_int(-1);
-    tm.tm_year = Child(date, kNsSchema, "Year").text().as_int(0) - 1900;
-    tm.tm_mon = Child(date, kNsSchema, "Month").text().as_int(0) - 1;
-    tm.tm_mday = Child(date, kNsSchema, "Day").text().as_int(0);
+    tm.tm_hour = names.Child(time, kNsSchema, "Hour").text().as_int(-1);
+    tm.tm_min = names.Child(time, kNsSchema, "Minute").text().as_int(-1);
+    tm.tm_sec = names.Child(time, kNsSchema, "Second").text().as_int(-1);
+    tm.tm_mday = names.Child(date, kNsSchema, "Day").text().as_int(0);
     if (tm.tm_hour < 0 || tm.tm_hour > 23 || tm.tm_min < 0 || tm.tm_min > 59 || tm.tm_sec < 0 ||
-        tm.tm_sec > 60 || tm.tm_year < 70 || tm.tm_mon < 0 || tm.tm_mon > 11 || tm.tm_mday < 1 ||
+        tm.tm_sec > 60 || year < 1970 || year > 9999 || month < 1 || month > 12 || tm.tm_mday < 1 ||
         tm.tm_mday > 31)
         return std::nullopt;
-    return timegm(&tm);
+    tm.tm_year = year - 1900;
+    tm.tm_mon = month - 1;
+    time_t t = timegm(&tm);
+    if (t == static_cast<time_t>(-1)) return std::nullopt;  // beyond time_t (32 bits: after 2038)
+    return t;
 }
 
 Reply::Addresses Reply::Services() const {
+    const Namespaces& names = impl_->names;
     Addresses a;
     if (!Is(kNsDevice, "GetServicesResponse")) return a;
-    for (pugi::xml_node s : Children(impl_->body, kNsDevice, "Service")) {
-        std::string ns = Text(Child(s, kNsDevice, "Namespace"));
-        std::string xaddr = Text(Child(s, kNsDevice, "XAddr"));
+    for (pugi::xml_node s : names.Children(impl_->body, kNsDevice, "Service")) {
+        std::string ns = Text(names.Child(s, kNsDevice, "Namespace"));
+        std::string xaddr = Text(names.Child(s, kNsDevice, "XAddr"));
         if (ns == kNsMedia && a.media.empty()) a.media = xaddr;
         if (ns == kNsPtz && a.ptz.empty()) a.ptz = xaddr;
     }
@@ -282,46 +331,50 @@ Reply::Addresses Reply::Services() const {
 }
 
 Reply::Addresses Reply::Capabilities() const {
+    const Namespaces& names = impl_->names;
     Addresses a;
     if (!Is(kNsDevice, "GetCapabilitiesResponse")) return a;
-    pugi::xml_node caps = Child(impl_->body, kNsDevice, "Capabilities");
-    a.media = Text(Child(Child(caps, kNsSchema, "Media"), kNsSchema, "XAddr"));
-    a.ptz = Text(Child(Child(caps, kNsSchema, "PTZ"), kNsSchema, "XAddr"));
+    pugi::xml_node caps = names.Child(impl_->body, kNsDevice, "Capabilities");
+    a.media = Text(names.Child(names.Child(caps, kNsSchema, "Media"), kNsSchema, "XAddr"));
+    a.ptz = Text(names.Child(names.Child(caps, kNsSchema, "PTZ"), kNsSchema, "XAddr"));
     return a;
 }
 
 std::vector<Reply::Profile> Reply::Profiles() const {
+    const Namespaces& names = impl_->names;
     std::vector<Profile> out;
     if (!Is(kNsMedia, "GetProfilesResponse")) return out;
-    for (pugi::xml_node p : Children(impl_->body, kNsMedia, "Profiles")) {
+    for (pugi::xml_node p : names.Children(impl_->body, kNsMedia, "Profiles")) {
         Profile profile;
         profile.token = p.attribute("token").as_string();
         if (profile.token.empty()) continue;
-        profile.sourceToken =
-            Text(Child(Child(p, kNsSchema, "VideoSourceConfiguration"), kNsSchema, "SourceToken"));
-        pugi::xml_node reso =
-            Child(Child(p, kNsSchema, "VideoEncoderConfiguration"), kNsSchema, "Resolution");
-        profile.width = Child(reso, kNsSchema, "Width").text().as_int(0);
-        profile.height = Child(reso, kNsSchema, "Height").text().as_int(0);
-        profile.ptz = static_cast<bool>(Child(p, kNsSchema, "PTZConfiguration"));
+        profile.sourceToken = Text(names.Child(
+            names.Child(p, kNsSchema, "VideoSourceConfiguration"), kNsSchema, "SourceToken"));
+        pugi::xml_node reso = names.Child(names.Child(p, kNsSchema, "VideoEncoderConfiguration"),
+                                          kNsSchema, "Resolution");
+        profile.width = names.Child(reso, kNsSchema, "Width").text().as_int(0);
+        profile.height = names.Child(reso, kNsSchema, "Height").text().as_int(0);
+        profile.ptz = static_cast<bool>(names.Child(p, kNsSchema, "PTZConfiguration"));
         out.push_back(profile);
     }
     return out;
 }
 
 std::string Reply::SnapshotUri() const {
+    const Namespaces& names = impl_->names;
     if (!Is(kNsMedia, "GetSnapshotUriResponse")) return "";
-    return Text(Child(Child(impl_->body, kNsMedia, "MediaUri"), kNsSchema, "Uri"));
+    return Text(names.Child(names.Child(impl_->body, kNsMedia, "MediaUri"), kNsSchema, "Uri"));
 }
 
 std::vector<Reply::Preset> Reply::Presets() const {
+    const Namespaces& names = impl_->names;
     std::vector<Preset> out;
     if (!Is(kNsPtz, "GetPresetsResponse")) return out;
-    for (pugi::xml_node p : Children(impl_->body, kNsPtz, "Preset")) {
+    for (pugi::xml_node p : names.Children(impl_->body, kNsPtz, "Preset")) {
         Preset preset;
         preset.token = p.attribute("token").as_string();
         if (preset.token.empty() || preset.token.size() > 64) continue;
-        preset.name = Text(Child(p, kNsSchema, "Name"));
+        preset.name = Text(names.Child(p, kNsSchema, "Name"));
         out.push_back(preset);
     }
     return out;

@@ -79,7 +79,9 @@ public:
     bool IsFault() const { return fault_.has_value(); }
     const Fault& GetFault() const { return *fault_; }
 
-    std::optional<time_t> SystemDateAndTimeUtc() const;  // nullopt: no UTCDateTime
+    // nullopt: no UTCDateTime, or not a time (fields out of range, a year
+    // outside 1970..9999, or beyond what time_t holds).
+    std::optional<time_t> SystemDateAndTimeUtc() const;
     struct Addresses {
         std::string media, ptz;  // XAddr as reported; empty when absent
     };

@@ -3,7 +3,6 @@
 #include <curl/curl.h>
 
 #include <algorithm>
-#include <cctype>
 #include <cstring>
 
 #include "hostlib/http/curl_global.h"
@@ -24,13 +23,6 @@ namespace {
 constexpr long kCurlBufferBytes = 65536;
 constexpr auto kMaxPollWait = std::chrono::milliseconds(1000);
 
-std::string Trim(const char* begin, const char* end) {
-    while (begin < end && (*begin == ' ' || *begin == '\t')) ++begin;
-    while (end > begin && (end[-1] == ' ' || end[-1] == '\t' || end[-1] == '\r' || end[-1] == '\n'))
-        --end;
-    return std::string(begin, end);
-}
-
 }  // namespace
 
 CurlTransfer::CurlTransfer() = default;
@@ -40,7 +32,7 @@ bool CurlTransfer::Start(const Request& request) {
     if (started_) return false;
     started_ = true;
     timeout_ = std::chrono::seconds(std::max(1, request.timeoutSeconds));
-    headerDeadline_ = Clock::now() + timeout_;
+    deadline_ = Clock::now() + timeout_;
     HostCurlGlobalInit();
 
     curl_ = std::make_unique<Curl>();
@@ -91,31 +83,16 @@ bool CurlTransfer::Start(const Request& request) {
 size_t CurlTransfer::OnHeader(char* data, size_t size, size_t count, void* self) {
     auto* t = static_cast<CurlTransfer*>(self);
     size_t n = size * count;
-    t->progress_ = true;
-    const char* end = data + n;
-    std::string line = Trim(data, end);
-    if (line.compare(0, 5, "HTTP/") == 0) {
-        // A new response (after a 1xx or an authentication round): forget the last one.
-        t->headers_.clear();
-        t->status_ = 0;
-        size_t sp = line.find(' ');
-        if (sp != std::string::npos) t->status_ = atoi(line.c_str() + sp + 1);
-    } else if (line.empty()) {
-        // curl answers 401/407 itself when it has credentials to try, so those
-        // headers are final only if a body or the end of the transfer follows.
-        if (t->status_ >= 200 && t->status_ != 401 && t->status_ != 407) t->headersDone_ = true;
-    } else if (const char* colon = static_cast<const char*>(memchr(data, ':', n))) {
-        std::string name = Trim(data, colon);
-        for (char& c : name) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-        t->headers_[name] = Trim(colon + 1, end);
-    }
+    t->head_.Line(data, n);
+    if (t->head_.Malformed()) return 0;  // curl ends the transfer with an error
+    if (t->head_.Final()) t->headersDone_ = true;
     return n;
 }
 
 size_t CurlTransfer::OnBody(char* data, size_t size, size_t count, void* self) {
     auto* t = static_cast<CurlTransfer*>(self);
     size_t n = size * count;
-    t->progress_ = true;
+    t->head_.Seal();
     t->headersDone_ = true;
     // curl hands the same bytes again after a pause, so take all or nothing.
     // With no read waiting (still in the headers), pause at once: curl keeps
@@ -179,21 +156,15 @@ bool CurlTransfer::WaitHeaders() {
     while (!headersDone_) {
         if (done_) {
             // Ended without a body: the last response's headers are all there is.
-            if (!doneOk_ || status_ == 0) failed_ = true;
+            if (!doneOk_ || head_.Status() == 0) failed_ = true;
             headersDone_ = !failed_;
             break;
         }
-        progress_ = false;
-        if (!Pump(headerDeadline_)) break;
-        if (!headersDone_ && !done_ && Clock::now() >= headerDeadline_) failed_ = true;
+        if (!Pump(deadline_)) break;
+        if (!headersDone_ && !done_ && Clock::now() >= deadline_) failed_ = true;
         if (failed_) break;
     }
     return headersDone_ && !failed_;
-}
-
-const std::string* CurlTransfer::Header(const std::string& lowerName) const {
-    auto it = headers_.find(lowerName);
-    return it == headers_.end() ? nullptr : &it->second;
 }
 
 long CurlTransfer::Read(char* dst, size_t size, bool fill) {
@@ -217,11 +188,8 @@ long CurlTransfer::Read(char* dst, size_t size, bool fill) {
         curl_easy_pause(curl_->easy, CURLPAUSE_CONT);  // may deliver the held piece at once
         kick_ = true;
     }
-    Clock::time_point deadline = Clock::now() + timeout_;
     while (targetLeft_ > 0 && (fill || targetLeft_ == size) && !done_ && !failed_) {
-        progress_ = false;
-        if (!Pump(deadline)) break;
-        if (progress_) deadline = Clock::now() + timeout_;
+        if (!Pump(deadline_)) break;
     }
     size_t stored = size - targetLeft_;
     target_ = nullptr;

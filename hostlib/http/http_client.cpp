@@ -52,9 +52,7 @@ int OvHttpClient::GetHttpContent(HTTP_MAP_KEY key, std::string& value) {
         found = impl_->transfer.Header("content-type");
         break;
     case HTTP_CONTENT_LENGTH:
-        // With a Transfer-Encoding the Content-Length does not delimit the body.
-        if (impl_->transfer.Header("transfer-encoding") == nullptr)
-            found = impl_->transfer.Header("content-length");
+        found = impl_->transfer.ContentLength();
         break;
     }
     if (found == nullptr) return -1;
@@ -125,7 +123,11 @@ MultipartFetch::~MultipartFetch() = default;
 int MultipartFetch::NextPartInfo(unsigned int& length, char* info, unsigned int infoSize) {
     Impl& m = *impl_;
     if (m.failed) return -1;
-    if (!m.parser && !m.Open()) {
+    // The first part's time runs from the connect (Open), each later part's
+    // from this call: a stream may run as long as its parts come in time.
+    if (m.parser) {
+        m.transfer.RestartDeadline();
+    } else if (!m.Open()) {
         m.failed = true;
         return -1;
     }

@@ -68,6 +68,37 @@ TEST(OnvifSoap, FaultsAndGarbage) {
         EXPECT_FALSE(r.Parse(bad)) << bad;
 }
 
+// The camera's clock: only a UTC time that is one, whatever ints the fields hold.
+TEST(OnvifSoap, SystemDateAndTimeIsReadOnlyWhenItIsATime) {
+    struct Case {
+        const char *year, *month, *day, *hour;
+        std::optional<time_t> expected;
+    } cases[] = {
+        {"2026", "1", "2", "3", 1767322800},  // 2026-01-02T03:00:00Z
+        {"1970", "1", "1", "0", 0},
+        {"1969", "12", "31", "23", std::nullopt},
+        {"10000", "1", "1", "0", std::nullopt},
+        {"2026", "13", "1", "0", std::nullopt},
+        {"2026", "1", "1", "24", std::nullopt},
+        {"-2147483648", "1", "1", "0", std::nullopt},  // no arithmetic on unchecked ints
+        {"2026", "-2147483648", "1", "0", std::nullopt},
+    };
+    for (const Case& c : cases) {
+        std::string date = std::string("<tt:Date><tt:Year>") + c.year + "</tt:Year><tt:Month>" +
+                           c.month + "</tt:Month><tt:Day>" + c.day + "</tt:Day></tt:Date>";
+        std::string time = std::string("<tt:Time><tt:Hour>") + c.hour +
+                           "</tt:Hour><tt:Minute>0</tt:Minute><tt:Second>0</tt:Second></tt:Time>";
+        Reply r;
+        ASSERT_TRUE(r.Parse(Wrap("s",
+                                 "<tds:GetSystemDateAndTimeResponse xmlns:tds=\"http://www.onvif.org/"
+                                 "ver10/device/wsdl\" xmlns:tt=" +
+                                     kTt + "><tds:SystemDateAndTime><tt:UTCDateTime>" + time + date +
+                                     "</tt:UTCDateTime></tds:SystemDateAndTime>"
+                                     "</tds:GetSystemDateAndTimeResponse>")));
+        EXPECT_EQ(r.SystemDateAndTimeUtc(), c.expected) << date << time;
+    }
+}
+
 TEST(OnvifSoap, MediaServiceIsTheVer10OneNotMedia2) {
     std::string reply = "<GetServicesResponse xmlns=\"http://www.onvif.org/ver10/device/wsdl\">";
     for (std::string s : {"ver20/media Media2", "ver10/media Media", "ver20/ptz PTZ"})

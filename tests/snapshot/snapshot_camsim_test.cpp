@@ -1,8 +1,11 @@
 // Snapshots from the camera simulator: every delivery of the image and the
 // stream, Digest auth, faults, the snapshot file through the camera layer,
-// and a stalled camera.
+// and cameras that stall or trickle.
 #include <gtest/gtest.h>
 #include <unistd.h>
+
+#include <functional>
+#include <thread>
 
 #include "camsim.h"
 #include "host/http.h"
@@ -75,21 +78,85 @@ TEST(SnapshotCamSim, DeliveriesGiveTheSameImageAndFaultsFail) {
 
 double SecondsSince(Clock::time_point start) { return std::chrono::duration<double>(Clock::now() - start).count(); }
 
-// A camera that accepts the connection and never answers: the stream fails
-// once its 10 s timeout has passed; the image client honours its own timeout
-// (1 s here instead of the 30 s SnapshotGet passes, which the unit tests pin).
-TEST(SnapshotCamSim, AStalledCameraFailsAfterTheTimeout) {
-    CamSim sim;
-    auto start = Clock::now();
-    EXPECT_EQ(Fetch(sim, 2, {{"delay_ms", "60000"}}), "FAILED");
-    EXPECT_GE(SecondsSince(start), 9.5);
-    EXPECT_LE(SecondsSince(start), 14);
-    start = Clock::now();
+// Seconds from the start of the call that failed to its -1; -1 when nothing failed.
+using Fetcher = std::function<double(CamSim&)>;
+
+// An image through the host's client with a 1 s timeout, from SendRequest on.
+double HostImage(CamSim& sim) {
     OvHttpClient client("127.0.0.1", sim.Port(), sim.SnapshotPath(), "admin", "secret", 1);
+    auto start = Clock::now();
     int status = 0;
-    EXPECT_TRUE(client.SendRequest(OV_HTTP_GET) != 0 || client.CheckResponse(status) != 0);
-    EXPECT_GE(SecondsSince(start), 0.9);
-    EXPECT_LE(SecondsSince(start), 3);
+    std::string body(200000, '\0');
+    if (client.SendRequest(OV_HTTP_GET) != 0 || client.CheckResponse(status) != 0 ||
+        client.ReadData(&body[0], static_cast<int>(body.size())) < 0)
+        return SecondsSince(start);
+    return -1;
+}
+
+// Parts of the stream through the host's reader with a 1 s timeout: `whole`
+// parts must come (taking longer than the timeout when there are many), then
+// the next NextPartInfo call is timed.
+Fetcher HostStream(int whole) {
+    return [whole](CamSim& sim) -> double {
+        MultipartFetch reader("127.0.0.1", sim.Port(), sim.MjpegPath().c_str(), "admin", "secret",
+                              1);
+        unsigned int length = 0;
+        char info[100];
+        auto start = Clock::now();
+        for (int i = 0; i < whole; ++i) {
+            std::string part(100000, '\0');
+            if (reader.NextPartInfo(length, info, sizeof info) != 0 || length > part.size() ||
+                reader.FetchContent(reinterpret_cast<unsigned char*>(&part[0]), length) != 0)
+                return -2;
+        }
+        if (whole > 0 && SecondsSince(start) < 1.2) return -3;  // did not outlast the timeout
+        start = Clock::now();
+        return reader.NextPartInfo(length, info, sizeof info) != 0 ? SecondsSince(start) : -1;
+    };
+}
+
+// The first frame through SnapshotGet: the library's own 10 s timeout.
+double LibraryStream(CamSim& sim) {
+    auto start = Clock::now();
+    std::string got = FetchSnapshot(sim.Port(), sim.MjpegPath(), 2, "admin", "secret");
+    return got == "FAILED" ? SecondsSince(start) : -1;  // a failure leaves no buffer
+}
+
+// A camera that stalls before answering, or that declares 100000 bytes and
+// sends one every 100 ms: every fetch fails with -1 at its deadline, however
+// slowly data keeps coming; a stream's later parts each get the whole timeout.
+// The cases run at once, one simulator each.
+TEST(SnapshotCamSim, StalledOrTricklingCamerasFailAtTheDeadline) {
+    const Faults stall = {{"delay_ms", "60000"}}, trickle = {{"trickle_ms", "100"}},
+                 trickle16th = {{"trickle_ms", "100"}, {"trickle_frame", "15"}};
+    struct Case {
+        const char* name;
+        Faults faults;
+        Fetcher fetch;
+        double deadline;  // seconds
+    } cases[] = {
+        {"image, stalled", stall, HostImage, 1},
+        {"image, trickled body", trickle, HostImage, 1},
+        {"stream, stalled", stall, HostStream(0), 1},
+        {"stream, trickled first part", trickle, HostStream(0), 1},
+        {"stream, 15 parts then a trickled one", trickle16th, HostStream(15), 1},
+        {"SnapshotGet, trickled first part", trickle, LibraryStream, 10},
+    };
+    std::vector<double> seconds(std::size(cases));
+    std::vector<std::thread> threads;
+    for (size_t i = 0; i < std::size(cases); ++i)
+        threads.emplace_back([&, i] {
+            CamSim sim;
+            for (const auto& f : cases[i].faults) sim.SetFault(f.first, f.second);
+            seconds[i] = cases[i].fetch(sim);
+        });
+    for (std::thread& t : threads) t.join();
+    for (size_t i = 0; i < std::size(cases); ++i) {
+        SCOPED_TRACE(cases[i].name);
+        EXPECT_GE(seconds[i], cases[i].deadline - 0.05);
+        EXPECT_LE(seconds[i], cases[i].deadline + 0.5);
+        printf("%s: -1 after %.3f s\n", cases[i].name, seconds[i]);
+    }
 }
 
 }  // namespace

@@ -235,6 +235,9 @@ TEST_F(SnapshotFileTest, TheFileIsReplacedWholeOrNotAtAllAndDeleted) {
     EXPECT_EQ(SnapshotFileGet(&camera_), -1);
     fake::SetHttpReply(fake::HttpReply().Length("100").Body("short"));
     EXPECT_EQ(SnapshotFileGet(&camera_), -1);
+    // A transport that gives up midway (its deadline passed) after some bytes.
+    fake::SetHttpReply(fake::HttpReply().Length("100").Generated(100).FailAfter(50));
+    EXPECT_EQ(SnapshotFileGet(&camera_), -1);
     EXPECT_EQ(FileContent(path_), "old image");
     unlink(path_.c_str());
     ASSERT_EQ(mkdir(path_.c_str(), 0700), 0);  // a directory at the path: the rename fails

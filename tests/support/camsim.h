@@ -71,6 +71,8 @@ public:
     //   "no_get_services"="1", "no_get_capabilities"="1"  the action answers a fault
     //   "alt_paths"="1"      media and PTZ services at /onvif/Media and /onvif/PTZ
     //   "internal_address"="host:port"  reported in service and snapshot addresses
+    //   "trickle_ms"=N       the image (MJPEG: frame "trickle_frame", default 0) declares
+    //                        a Content-Length of 100000, then sends one byte every N ms
     void SetFault(const std::string& name, const std::string& value);
     void ClearFaults();
 

@@ -20,7 +20,9 @@
 // time_auth (GetSystemDateAndTime needs credentials), time_no_utc,
 // clock_skew_s, no_get_services, no_get_capabilities, alt_paths
 // (/onvif/Media, /onvif/PTZ), internal_address ("host:port" reported in
-// service and snapshot addresses, as a camera behind NAT does).
+// service and snapshot addresses, as a camera behind NAT does), trickle_ms
+// (the image, or stream frame trickle_frame (default 0), declares a
+// Content-Length of 100000 and then sends one byte every trickle_ms ms).
 // GotoPreset carries only a token; every one received is logged on stderr
 // (unless the environment has CAMSIM_QUIET).
 #include "camsim.h"
@@ -53,6 +55,22 @@ double State::Now() const {
 namespace {
 
 const char* kBoundary = "camsimframe";
+const size_t kTrickleBytes = 100000;
+
+// Milliseconds between the bytes of a trickled body; 0 when not trickling.
+long TrickleMs(State& state) {
+    return std::max(0L, std::min(atol(state.Fault("trickle_ms").c_str()), 10000L));
+}
+
+// Sends `count` bytes one at a time, `ms` apart; false once the client is gone.
+bool Trickle(httplib::DataSink& sink, size_t count, long ms) {
+    for (size_t i = 0; i < count; ++i) {
+        if (i > 0) std::this_thread::sleep_for(std::chrono::milliseconds(ms));
+        char byte = static_cast<char>(i & 0xff);
+        if (!sink.is_writable() || !sink.write(&byte, 1)) return false;
+    }
+    return true;
+}
 
 bool IsControl(const std::string& path) { return path.rfind("/control/", 0) == 0; }
 
@@ -201,6 +219,13 @@ void Serve(State& state, httplib::Server& svr) {
 
     svr.Get("/snapshot.jpg", [&state](const httplib::Request& req, httplib::Response& res) {
         if (!DigestOk(state, req)) return Challenge(res);
+        if (long ms = TrickleMs(state)) {
+            res.set_content_provider(kTrickleBytes, "image/jpeg",
+                                     [ms](size_t offset, size_t length, httplib::DataSink& sink) {
+                                         return offset == 0 && Trickle(sink, length, ms);
+                                     });
+            return;
+        }
         std::string delivery = state.Fault("snapshot_delivery");
         SendBody(state, res, 200, PresetJpeg(CurrentToken(state), 160, 90), "image/jpeg",
                  delivery.empty() ? "length" : delivery);
@@ -211,13 +236,23 @@ void Serve(State& state, httplib::Server& svr) {
         int frames = req.has_param("frames") ? atoi(req.get_param_value("frames").c_str()) : 50;
         frames = std::max(1, std::min(frames, 600));
         bool drop = state.Fault("drop_mid_body") == "1";
+        long trickleMs = TrickleMs(state);
+        int trickleFrame = atoi(state.Fault("trickle_frame").c_str());
         State* s = &state;
         res.set_header("Connection", "close");
         res.set_content_provider(
             std::string("multipart/x-mixed-replace; boundary=") + kBoundary,
-            [s, frames, drop](size_t, httplib::DataSink& sink) {
+            [s, frames, drop, trickleMs, trickleFrame](size_t, httplib::DataSink& sink) {
                 for (int i = 0; i < frames; ++i) {
                     if (i > 0) std::this_thread::sleep_for(std::chrono::milliseconds(100));
+                    if (trickleMs > 0 && i == trickleFrame) {
+                        std::string head = std::string("--") + kBoundary +
+                                           "\r\nContent-Type: image/jpeg\r\nContent-Length: " +
+                                           std::to_string(kTrickleBytes) + "\r\n\r\n";
+                        if (!sink.write(head.data(), head.size())) return false;
+                        if (!Trickle(sink, kTrickleBytes, trickleMs)) return false;
+                        continue;
+                    }
                     std::string jpeg = PresetJpeg(CurrentToken(*s), 160, 90);
                     // Even frames carry a Content-Length, odd ones only the boundary.
                     std::string part =
