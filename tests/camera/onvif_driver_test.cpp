@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <thread>
 
@@ -161,18 +162,24 @@ TEST_F(OnvifDriver, FaultsAndBrokenRepliesAreFailuresNeverEmptyLists) {
 
 TEST_F(OnvifDriver, SlowOrStoppedCameraFailsWithinTheTimeout) {
     onvif::SetCallTimeoutMs(300);
+    // Each failing call ends near the 300 ms bound; only they are timed (the
+    // set-up, a simulator started and warmed, can be slow on a loaded machine).
+    const auto failsInTime = [](const std::function<bool()>& call) {
+        const auto start = std::chrono::steady_clock::now();
+        const bool failed = call();
+        EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(1000));
+        return failed;
+    };
     ASSERT_EQ(Onvif(sim.Port())->GoPreset(1, "kelo1"), 0);  // cache warm
     sim.SetFault("delay_ms", "1500");
-    auto start = std::chrono::steady_clock::now();
-    EXPECT_EQ(Onvif(sim.Port())->GoPreset(2, "kelo2"), -1);
+    EXPECT_TRUE(failsInTime([&] { return Onvif(sim.Port())->GoPreset(2, "kelo2") == -1; }));
     auto stopped = std::make_unique<CamSim>();
     int port = stopped->Port();
     ASSERT_EQ(Onvif(port)->GoPreset(1, "kelo1"), 0);
     stopped.reset();
     Presets presets;
-    EXPECT_EQ(Onvif(port)->GetPresetList(presets), -1);
-    EXPECT_EQ(SnapshotPath(*Onvif(port)), "failed");
-    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(1500));
+    EXPECT_TRUE(failsInTime([&] { return Onvif(port)->GetPresetList(presets) == -1; }));
+    EXPECT_TRUE(failsInTime([&] { return SnapshotPath(*Onvif(port)) == "failed"; }));
 }
 
 TEST_F(OnvifDriver, ThreadsShareOneCameraSafely) {
