@@ -71,6 +71,7 @@ public:
     //   "no_get_services"="1", "no_get_capabilities"="1"  the action answers a fault
     //   "alt_paths"="1"      media and PTZ services at /onvif/Media and /onvif/PTZ
     //   "internal_address"="host:port"  reported in service and snapshot addresses
+    //   "snapshot_stream"="1" GetSnapshotUri gives the MJPEG stream (20 frames)
     void SetFault(const std::string& name, const std::string& value);
     void ClearFaults();
 

@@ -1,7 +1,7 @@
 // camsim: a PTZ network camera on 127.0.0.1 for tests and checks.
 //
 //   camsim [--port N] [--user U] [--password P] [--preset TOKEN=NAME]...
-//          [--exit-on-stdin-eof]
+//          [--snapshot-stream] [--exit-on-stdin-eof]
 //
 // Prints "CAMSIM_PORT=<port>" on stdout once it listens (port 0, the default,
 // picks a free one). Without --preset it has presets 1 Home, 2 Door, 5 Gate,
@@ -20,7 +20,9 @@
 // time_auth (GetSystemDateAndTime needs credentials), time_no_utc,
 // clock_skew_s, no_get_services, no_get_capabilities, alt_paths
 // (/onvif/Media, /onvif/PTZ), internal_address ("host:port" reported in
-// service and snapshot addresses, as a camera behind NAT does).
+// service and snapshot addresses, as a camera behind NAT does),
+// snapshot_stream (GetSnapshotUri gives the MJPEG stream, 20 frames; set from
+// the start by --snapshot-stream).
 // GotoPreset carries only a token; every one received is logged on stderr
 // (unless the environment has CAMSIM_QUIET).
 #include "camsim.h"
@@ -310,7 +312,7 @@ void Serve(State& state, httplib::Server& svr) {
 void Usage() {
     fprintf(stderr,
             "usage: camsim [--port N] [--user U] [--password P] [--preset TOKEN=NAME]... "
-            "[--exit-on-stdin-eof]\n");
+            "[--snapshot-stream] [--exit-on-stdin-eof]\n");
     exit(2);
 }
 
@@ -340,6 +342,8 @@ int main(int argc, char** argv) {
             state.presets.push_back(
                 {p.substr(0, eq), eq == std::string::npos ? std::string() : p.substr(eq + 1)});
             presetsGiven = true;
+        } else if (a == "--snapshot-stream") {
+            state.faults["snapshot_stream"] = "1";
         } else if (a == "--exit-on-stdin-eof") {
             exitOnEof = true;
         } else {
