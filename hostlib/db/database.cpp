@@ -1,5 +1,7 @@
 // PostgreSQL database layer on libpq: a pool of connections, statements run
 // with PQexec, results kept as PGresult until the caller frees them.
+#include "host/database.h"
+
 #include <libpq-fe.h>
 #include <poll.h>
 
@@ -9,7 +11,6 @@
 #include <string>
 #include <vector>
 
-#include "host/database.h"
 #include "hostlib/db/database_config.h"
 
 const char* gszTablePatrol = "patrol";
@@ -95,7 +96,11 @@ public:
         return generation_;
     }
 
-private:
+    std::string ConnInfo() {
+        std::lock_guard<std::mutex> lock(mu_);
+        return conninfo_;
+    }
+
     static ConnPtr Connect(const std::string& conninfo) {
         // Later keywords win: the host's settings may override the timeout.
         const char* keys[] = {"connect_timeout", "dbname", "client_encoding", nullptr};
@@ -106,6 +111,7 @@ private:
         return conn;
     }
 
+private:
     // An idle connection has nothing to read unless its server sent a
     // termination notice or closed it (restart, shutdown, idle kill): then it
     // is reset before a statement is sent on it.
@@ -162,6 +168,37 @@ PGresult* Run(const std::string& sql) {
 }  // namespace
 
 void HostDBSetConnInfo(const std::string& conninfo) { ThePool().SetConnInfo(conninfo); }
+
+int HostDBCheck(std::string* where, std::string* error) {
+    {
+        Lease lease;
+        if (lease.get()) return 0;
+    }
+    // The pool gives no reason: one more attempt, kept to read it.
+    ConnPtr conn = Pool::Connect(ThePool().ConnInfo());
+    if (conn && PQstatus(conn.get()) == CONNECTION_OK) return 0;
+    std::string tried, message = conn ? PQerrorMessage(conn.get()) : "out of memory";
+    if (conn) {
+        const std::string host = PQhost(conn.get()) ? PQhost(conn.get()) : "";
+        const std::string port = PQport(conn.get()) ? PQport(conn.get()) : "";
+        tried =
+            host.empty() || host[0] == '/'
+                ? "socket " + (host.empty() ? std::string("(default)") : host) + "/.s.PGSQL." + port
+                : "host " + host + " port " + port;
+        tried += std::string(", database ") + (PQdb(conn.get()) ? PQdb(conn.get()) : "") +
+                 ", user " + (PQuser(conn.get()) ? PQuser(conn.get()) : "");
+    }
+    // One line: libpq's message may carry a hint on a second line.
+    std::string line;
+    for (char c : message) {
+        if (c == '\n' || c == '\t' || c == '\r') c = ' ';
+        if (!(c == ' ' && (line.empty() || line.back() == ' '))) line += c;
+    }
+    while (!line.empty() && line.back() == ' ') line.pop_back();
+    if (where) *where = tried;
+    if (error) *error = line;
+    return -1;
+}
 void HostDBSetPoolSize(int size) { ThePool().SetSize(size); }
 void HostDBCloseIdle() { ThePool().CloseIdle(); }
 

@@ -30,5 +30,8 @@ CREATE TABLE IF NOT EXISTS camera (
     model     text    NOT NULL DEFAULT '',
     channel   text    NOT NULL DEFAULT '',
     path      text    NOT NULL DEFAULT '',
-    liveReso  text    NOT NULL DEFAULT ''
+    liveReso  text    NOT NULL DEFAULT '',
+    snapshotType integer NOT NULL DEFAULT 1  -- user-defined cameras: 1 image, 2 MJPEG stream at path
 );
+-- Tables made before the column existed.
+ALTER TABLE camera ADD COLUMN IF NOT EXISTS snapshotType integer NOT NULL DEFAULT 1;
