@@ -1,6 +1,8 @@
 -- Tables of the patrol store and the camera records the host layer reads.
 -- Unquoted names fold to lower case (camId is stored as camid); the library's
 -- statements spell them in camel case and reach the same columns.
+-- Safe to run again: it creates only what is missing.
+SET client_min_messages = warning;
 
 CREATE TABLE IF NOT EXISTS patrol (
     id        serial  PRIMARY KEY,

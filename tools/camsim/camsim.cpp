@@ -11,6 +11,7 @@
 //   GET  /mjpeg?profile=P&frames=N multipart/x-mixed-replace, 10 frames a second
 // and, without auth, the control endpoints for tests:
 //   GET  /control/ping | presets | moves | now | current | requests (count, control aside)
+//        (moves: "token<TAB>seconds since start<TAB>CLOCK_MONOTONIC seconds" lines)
 //   POST /control/presets (lines "token<TAB>name"), /control/moves/clear,
 //        /control/fault ("name=value"; empty value clears), /control/faults/clear
 // Faults: delay_ms, status, refuse, snapshot_delivery (length|chunked|close),
@@ -263,9 +264,13 @@ void Serve(State& state, httplib::Server& svr) {
     svr.Get("/control/moves", [&state](const httplib::Request&, httplib::Response& res) {
         std::string out;
         std::lock_guard<std::mutex> lock(state.mu);
+        // token, seconds since start, and the same moment on the system's
+        // monotonic clock (to compare with other processes' times)
+        const double origin =
+            std::chrono::duration<double>(state.start.time_since_epoch()).count();
         for (const Move& m : state.moves) {
-            char t[40];
-            snprintf(t, sizeof t, "%.6f", m.seconds);
+            char t[80];
+            snprintf(t, sizeof t, "%.6f\t%.6f", m.seconds, origin + m.seconds);
             out += m.token + "\t" + t + "\n";
         }
         res.set_content(out, "text/plain");

@@ -1,0 +1,306 @@
+// ptzpatrol run and guard: a PatrolExecutor (and a GuardExecutor) in this
+// process, each move printed as the executor reports it.
+#include <poll.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <map>
+#include <thread>
+
+#include "commands.h"
+#include "executor/guardExecutor.h"
+#include "executor/patrolExecutor.h"
+#include "patrol/patrol.h"
+
+namespace ptztool {
+namespace {
+
+using nlohmann::json;
+using Clock = std::chrono::steady_clock;
+
+constexpr auto kPoll = std::chrono::milliseconds(10);  // how often the run's progress is read
+
+// Loads a patrol as the executor will (its presets checked against the camera).
+Patrol LoadPatrol(int id) {
+    if (Query("SELECT id FROM patrol WHERE id = " + itos(id) + ";", {"id"}).empty())
+        throw Error{kUnknownId, "no patrol " + std::to_string(id)};
+    Patrol patrol;
+    if (patrol.Load(id) != 0)
+        throw Error{kDbError, "loading patrol " + std::to_string(id) + " failed"};
+    return patrol;
+}
+
+// Prints the runs and moves of one executor as its progress changes.
+class Watcher {
+public:
+    Watcher(PatrolExecutor& executor, const std::string& snapshotDir)
+        : executor_(executor), snapshotDir_(snapshotDir) {}
+
+    void Know(const Patrol& patrol) { patrols_[patrol.GetId()] = patrol; }
+
+    // Reads the progress once and prints what changed since the last look.
+    PATROL_RUN_PROGRESS Look() {
+        const PATROL_RUN_PROGRESS p = executor_.GetRunProgress();
+        if (p.runs != last_.runs) {
+            if (last_.running) {  // the run in progress gave way to another request
+                Out::Emit(ClockText() + "  run " + std::to_string(last_.runs) + " gave way after " +
+                              std::to_string(runMoves_) + " moves",
+                          {{"event", "end"},
+                           {"time", IsoTime()},
+                           {"run", last_.runs},
+                           {"patrol", last_.patrolId},
+                           {"type", TypeName(last_.type)},
+                           {"moves", runMoves_},
+                           {"complete", false},
+                           {"displaced", true}});
+            }
+            runMoves_ = 0;
+            RunStarted(p);
+        }
+        if (p.moves != last_.moves) {
+            runMoves_ += p.moves - last_.moves;
+            Moved(p);
+        }
+        if (last_.running && !p.running) RunEnded(p);
+        last_ = p;
+        return p;
+    }
+    unsigned int RunMoves() const { return runMoves_; }
+
+private:
+    std::string PatrolName(int id) const {
+        auto it = patrols_.find(id);
+        return it == patrols_.end() ? std::string() : it->second.GetName();
+    }
+    std::string PresetName(int id, int index) const {
+        auto it = patrols_.find(id);
+        PRESET_INFO preset{0, ""};
+        if (it == patrols_.end() || it->second.GetPresetFromList(index, &preset) != 0) return "";
+        return preset.name;
+    }
+
+    void RunStarted(const PATROL_RUN_PROGRESS& p) {
+        auto it = patrols_.find(p.patrolId);
+        const int stay = it == patrols_.end() ? 0 : it->second.GetStayTime();
+        Out::Emit(ClockText() + "  run " + std::to_string(p.runs) + ": patrol " +
+                      std::to_string(p.patrolId) + " '" + PatrolName(p.patrolId) + "', " +
+                      std::to_string(p.presetCount) +
+                      (p.presetCount == 1 ? " preset, stay " : " presets, stay ") +
+                      std::to_string(stay) + " s, " + TypeName(p.type),
+                  {{"event", "run"},
+                   {"time", IsoTime()},
+                   {"mono", Monotonic()},
+                   {"run", p.runs},
+                   {"patrol", p.patrolId},
+                   {"name", PatrolName(p.patrolId)},
+                   {"type", TypeName(p.type)},
+                   {"count", p.presetCount},
+                   {"stay", stay}});
+    }
+
+    void Moved(const PATROL_RUN_PROGRESS& p) {
+        const bool closing = p.presetIndex == 0 && runMoves_ > 1;
+        const std::string name = PresetName(p.patrolId, p.presetIndex);
+        json j = {{"event", "move"},        {"time", IsoTime()},      {"mono", Monotonic()},
+                  {"run", p.runs},          {"patrol", p.patrolId},   {"type", TypeName(p.type)},
+                  {"index", p.presetIndex}, {"count", p.presetCount}, {"position", p.position},
+                  {"name", name},           {"moves", p.moves},       {"closing", closing}};
+        std::string text =
+            ClockText() + "  " + TypeName(p.type) + "  patrol " + std::to_string(p.patrolId) +
+            "  preset " + std::to_string(p.presetIndex + 1) + " of " +
+            std::to_string(p.presetCount) + "  position " + std::to_string(p.position) +
+            (name.empty() ? "" : "  " + name) + (closing ? "  (back to the first preset)" : "");
+        if (!snapshotDir_.empty()) {
+            char file[64];
+            snprintf(file, sizeof file, "/%03u-run%u-p%d.jpg", p.moves, p.runs, p.position);
+            auto it = patrols_.find(p.patrolId);
+            try {
+                const Camera camera = LoadCamera(it == patrols_.end() ? 0 : it->second.GetCamId());
+                const SnapshotTaken s = TakeSnapshot(camera, snapshotDir_ + file);
+                j["snapshot"] = SnapshotJson(s);
+                text += "\n              snapshot " + SnapshotText(s);
+            } catch (const Error& e) {
+                j["snapshot_error"] = e.message;
+                text += "\n              snapshot failed: " + e.message;
+            }
+        }
+        Out::Emit(text, j);
+    }
+
+    void RunEnded(const PATROL_RUN_PROGRESS& p) {
+        const bool complete = runMoves_ == static_cast<unsigned int>(p.presetCount) + 1;
+        Out::Emit(ClockText() + "  run " + std::to_string(p.runs) + " ended after " +
+                      std::to_string(runMoves_) + " moves" +
+                      (complete ? "" : " (not a whole tour)"),
+                  {{"event", "end"},
+                   {"time", IsoTime()},
+                   {"run", p.runs},
+                   {"patrol", p.patrolId},
+                   {"type", TypeName(p.type)},
+                   {"moves", runMoves_},
+                   {"complete", complete}});
+    }
+
+    PatrolExecutor& executor_;
+    std::string snapshotDir_;
+    std::map<int, Patrol> patrols_;
+    PATROL_RUN_PROGRESS last_ = {0, 0, PATROL_EXEC_NONE, 0, -1, 0, 0, 0};
+    unsigned int runMoves_ = 0;
+};
+
+// The camera of a patrol, checked to answer (its presets are read).
+Camera CheckedCamera(const Patrol& patrol) {
+    const Camera camera = LoadCamera(patrol.GetCamId());
+    CameraPresets(camera);
+    return camera;
+}
+
+}  // namespace
+
+int Run(int patrolId, const RunOptions& options) {
+    RequireDatabase(true);
+    const Patrol patrol = LoadPatrol(patrolId);
+    const Camera camera = CheckedCamera(patrol);
+    if (patrol.GetPresetListNum() == 0)
+        throw Error{kUnknownId,
+                    "patrol " + std::to_string(patrolId) + " has no presets the camera has"};
+    CatchStopSignals();
+
+    PatrolExecutor executor;
+    Watcher watcher(executor, options.snapshotDir);
+    watcher.Know(patrol);
+    watcher.Look();
+    executor.Execute(patrolId, PATROL_EXEC_DIRECT);
+    const auto asked = Clock::now();
+    for (;;) {
+        std::this_thread::sleep_for(kPoll);
+        const PATROL_RUN_PROGRESS p = watcher.Look();
+        if (gStopSignal != 0) {
+            executor.RemovePatrol(PATROL_EXEC_DIRECT);
+            Out::Emit(ClockText() + "  stopped", {{"event", "stopped"}, {"time", IsoTime()}});
+            return kInterrupted;  // the executor stops and joins its worker on the way out
+        }
+        if (p.runs == 0 && Clock::now() - asked > std::chrono::seconds(15))
+            throw Error{kDbError, "the executor did not start patrol " + std::to_string(patrolId)};
+        if (p.runs > 0 && !p.running) break;
+    }
+    if (watcher.RunMoves() == static_cast<unsigned int>(patrol.GetPresetListNum()) + 1) return kOk;
+    // A move failed: tell why if the camera says so.
+    CheckedCamera(patrol);
+    throw Error{kCameraRefused, "camera " + std::to_string(camera.GetId()) +
+                                    " refused a move after " + std::to_string(watcher.RunMoves()) +
+                                    " moves (see the system log)"};
+}
+
+int Guard(int patrolId, const GuardOptions& o) {
+    const std::map<std::string, int> modes = {{"off", GUARD_MODE_OFF},
+                                              {"continuous", GUARD_MODE_CONTINUOUS},
+                                              {"first", GUARD_MODE_FIRST_EVENT},
+                                              {"second", GUARD_MODE_SECOND_EVENT},
+                                              {"any", GUARD_MODE_ANY_EVENT}};
+    auto mode = modes.find(o.mode);
+    if (mode == modes.end())
+        throw Error{kUsage, "--mode must be continuous, first, second, any or off"};
+    if (o.pauseMinutes < 0 || o.pauseMinutes > 35)
+        throw Error{kUsage, "--pause must be 0 to 35 minutes"};
+    if (o.eventValidSeconds < 0 || o.eventValidSeconds > 2147)
+        throw Error{kUsage, "--event-valid must be 0 to 2147 seconds"};
+    RequireDatabase(true);
+    const Patrol patrol = LoadPatrol(patrolId);
+    CheckedCamera(patrol);
+    CatchStopSignals();
+
+    PatrolExecutor executor;
+    Watcher watcher(executor, o.snapshotDir);
+    watcher.Know(patrol);
+    watcher.Look();
+    GuardExecutor guard(1);
+    guard.Init(&executor, o.repeat, o.pauseMinutes, o.eventValidSeconds);
+    EVENT_STATUS first = {}, second = {};
+    const GuardScheduleInfo entry = {patrolId, mode->second};
+    const char* stateNames[] = {"idle", "running", "interval", "holdoff"};
+    int state = GUARD_STATE_IDLE;
+    auto lastSchedule = Clock::now() - std::chrono::seconds(1);
+    std::string pending;
+    bool inputOpen = true;
+    Out::Emit(
+        ClockText() + "  guard on patrol " + std::to_string(patrolId) + ", mode " + o.mode +
+            ", repeat " + std::to_string(o.repeat) + ", pause " + std::to_string(o.pauseMinutes) +
+            " min; input: first on|off, second on|off, direct ID, direct stop, quit",
+        {{"event", "guard-start"}, {"time", IsoTime()}, {"patrol", patrolId}, {"mode", o.mode}});
+
+    // One line of input; false: quit.
+    const auto handle = [&](const std::string& line) -> bool {
+        std::string word, arg;
+        const size_t space = line.find(' ');
+        word = line.substr(0, space);
+        arg = space == std::string::npos ? "" : line.substr(space + 1);
+        Out::Emit(ClockText() + "  input: " + line,
+                  {{"event", "input"}, {"time", IsoTime()}, {"line", line}});
+        if (word == "quit") return false;
+        if ((word == "first" || word == "second") && (arg == "on" || arg == "off")) {
+            EVENT_STATUS& e = word == "first" ? first : second;
+            e.active = arg == "on" ? 1 : 0;
+            gettimeofday(&e.timestamp, nullptr);
+            guard.AnalyzeSchedule(first, second, entry);
+        } else if (word == "direct" && arg == "stop") {
+            executor.RemovePatrol(PATROL_EXEC_DIRECT);
+        } else if (word == "direct" && !arg.empty()) {
+            try {
+                const Patrol direct = LoadPatrol(atoi(arg.c_str()));
+                watcher.Know(direct);
+                executor.Execute(direct.GetId(), PATROL_EXEC_DIRECT);
+            } catch (const Error& e) {
+                fprintf(stderr, "ptzpatrol: %s\n", e.message.c_str());
+            }
+        } else {
+            fprintf(stderr,
+                    "ptzpatrol: unknown input '%s' (first on|off, second on|off, direct ID, direct "
+                    "stop, quit)\n",
+                    line.c_str());
+        }
+        return true;
+    };
+
+    bool quit = false;
+    while (!quit && gStopSignal == 0) {
+        struct pollfd in = {0, POLLIN, 0};
+        if (inputOpen && poll(&in, 1, static_cast<int>(kPoll.count())) > 0) {
+            char buffer[512];
+            const ssize_t n = read(0, buffer, sizeof buffer);
+            if (n <= 0) {
+                inputOpen = false;
+                quit = true;  // end of input ends the guard
+            } else {
+                pending.append(buffer, static_cast<size_t>(n));
+            }
+            for (size_t nl; !quit && (nl = pending.find('\n')) != std::string::npos;) {
+                std::string line = pending.substr(0, nl);
+                pending.erase(0, nl + 1);
+                if (!line.empty() && line.back() == '\r') line.pop_back();
+                if (!line.empty()) quit = !handle(line);
+            }
+        } else if (!inputOpen) {
+            std::this_thread::sleep_for(kPoll);
+        }
+        // The schedule entry in force, as a host hands it over from time to time.
+        if (Clock::now() - lastSchedule >= std::chrono::milliseconds(250)) {
+            guard.AnalyzeSchedule(first, second, entry);
+            lastSchedule = Clock::now();
+        }
+        const int now = guard.GetState();
+        if (now != state) {
+            state = now;
+            Out::Emit(ClockText() + "  guard: " + stateNames[now & 3],
+                      {{"event", "guard"}, {"time", IsoTime()}, {"state", stateNames[now & 3]}});
+        }
+        watcher.Look();
+    }
+    guard.Terminate();
+    executor.RemovePatrol(PATROL_EXEC_GUARD);
+    executor.RemovePatrol(PATROL_EXEC_DIRECT);
+    Out::Emit(ClockText() + "  guard stopped", {{"event", "stopped"}, {"time", IsoTime()}});
+    return gStopSignal != 0 ? kInterrupted : kOk;
+}
+
+}  // namespace ptztool
