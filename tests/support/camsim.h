@@ -49,6 +49,7 @@ public:
     struct Move {
         std::string token;
         double seconds;
+        double monotonic;  // the same moment on CLOCK_MONOTONIC, in seconds
     };
     std::vector<Move> Moves();
     void ClearMoves();
