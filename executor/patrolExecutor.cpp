@@ -41,6 +41,7 @@ PatrolExecutor::PatrolExecutor()
       progressCount(0),
       progressIndex(-1),
       progressPosition(0),
+      progressRunMoves(0),
       progressMoves(0),
       progressRuns(0) {
     pthread_mutex_init(&mutex, nullptr);
@@ -100,6 +101,7 @@ PATROL_RUN_PROGRESS PatrolExecutor::GetRunProgress() const {
             p.presetCount = progressCount.load(acquire);
             p.presetIndex = progressIndex.load(acquire);
             p.position = progressPosition.load(acquire);
+            p.runMoves = progressRunMoves.load(acquire);
             p.moves = progressMoves.load(acquire);
             p.runs = progressRuns.load(acquire);
             if (progressSeq.load(std::memory_order_relaxed) == before) return p;
@@ -371,6 +373,7 @@ void PatrolExecutor::PublishRunStart(const Patrol& patrol, PATROL_EXEC_TYPE type
     progressCount.store(patrol.GetPresetListNum(), kRelease);
     progressIndex.store(-1, kRelease);
     progressPosition.store(0, kRelease);
+    progressRunMoves.store(0, kRelease);
     progressRuns.store(progressRuns.load(std::memory_order_relaxed) + 1, kRelease);
 }
 
@@ -378,6 +381,7 @@ void PatrolExecutor::PublishMove(int presetIndex, int position) {
     ProgressWrite write(progressSeq);
     progressIndex.store(presetIndex, kRelease);
     progressPosition.store(position, kRelease);
+    progressRunMoves.store(progressRunMoves.load(std::memory_order_relaxed) + 1, kRelease);
     progressMoves.store(progressMoves.load(std::memory_order_relaxed) + 1, kRelease);
 }
 

@@ -50,6 +50,11 @@ typedef struct __tag_PATROL_RUN_PROGRESS {
     // closing move of a tour goes back to index 0.
     int presetIndex;
     int position;  // the camera's preset number of presetIndex; 0 while it is -1
+    // Moves the camera accepted in this run: 0 at its start, presetCount + 1
+    // once the tour closed. The k-th move of a run goes to index k - 1, the
+    // last (k = presetCount + 1) back to index 0: with `moves` a poller that
+    // missed some can tell which they were.
+    int runMoves;
     // Moves the camera accepted on this executor since it was constructed,
     // closing moves included. Monotonic (wraps at 2^32): a poller that sees it
     // change by one has seen every move.
@@ -144,7 +149,7 @@ private:
     // atomic fields, written by the worker only, read by GetRunProgress.
     std::atomic<unsigned int> progressSeq;
     std::atomic<int> progressRunning, progressPatrolId, progressType, progressCount;
-    std::atomic<int> progressIndex, progressPosition;
+    std::atomic<int> progressIndex, progressPosition, progressRunMoves;
     std::atomic<unsigned int> progressMoves, progressRuns;
 };
 

@@ -36,7 +36,7 @@ void StorePatrol(int id, int stayTime, const std::vector<int>& positions) {
 
 auto Fields(const PATROL_RUN_PROGRESS& p) {
     return std::make_tuple(p.running, p.patrolId, static_cast<int>(p.type), p.presetCount,
-                           p.presetIndex, p.position, p.moves, p.runs);
+                           p.presetIndex, p.position, p.runMoves, p.moves, p.runs);
 }
 
 class RunProgressTest : public ::testing::Test {
@@ -50,7 +50,7 @@ protected:
 
 TEST_F(RunProgressTest, EachMoveIsShownUntilTheNextAndTheLastRunStaysAfterItsEnd) {
     EXPECT_EQ(Fields(executor.GetRunProgress()),
-              std::make_tuple(0, 0, static_cast<int>(PATROL_EXEC_NONE), 0, -1, 0, 0u, 0u));
+              std::make_tuple(0, 0, static_cast<int>(PATROL_EXEC_NONE), 0, -1, 0, 0, 0u, 0u));
     StorePatrol(30, 0, {5, 2, 9});
     StorePatrol(31, 1, {7, 8});
     StorePatrol(32, 1, {5, 2, 9});
@@ -63,14 +63,14 @@ TEST_F(RunProgressTest, EachMoveIsShownUntilTheNextAndTheLastRunStaysAfterItsEnd
     const int guard = PATROL_EXEC_GUARD, direct = PATROL_EXEC_DIRECT;
     using F = decltype(Fields(seen[0]));
     const std::vector<F> expected = {
-        F{1, 30, guard, 3, -1, 0, 0u, 1u},  // the first move: none made yet
-        F{1, 30, guard, 3, 0, 5, 1u, 1u}, F{1, 30, guard, 3, 1, 2, 2u, 1u},
-        F{1, 30, guard, 3, 2, 9, 3u, 1u},  // the closing move, back to index 0
+        F{1, 30, guard, 3, -1, 0, 0, 0u, 1u},  // the first move: none made yet
+        F{1, 30, guard, 3, 0, 5, 1, 1u, 1u}, F{1, 30, guard, 3, 1, 2, 2, 2u, 1u},
+        F{1, 30, guard, 3, 2, 9, 3, 3u, 1u},  // the closing move, back to index 0
     };
     ASSERT_EQ(seen.size(), expected.size());
     for (size_t i = 0; i < seen.size(); ++i)
         EXPECT_EQ(Fields(seen[i]), expected[i]) << "move " << i;
-    EXPECT_EQ(Fields(executor.GetRunProgress()), (F{0, 30, guard, 3, 0, 5, 4u, 1u}));
+    EXPECT_EQ(Fields(executor.GetRunProgress()), (F{0, 30, guard, 3, 0, 5, 4, 4u, 1u}));
 
     // A direct run displaces a guard run, which then starts again: new runs.
     fake::OnGoPreset(nullptr);
@@ -78,10 +78,10 @@ TEST_F(RunProgressTest, EachMoveIsShownUntilTheNextAndTheLastRunStaysAfterItsEnd
     ASSERT_TRUE(WaitForMoves(5));
     executor.Execute(31, PATROL_EXEC_DIRECT);
     ASSERT_TRUE(WaitForMoves(6));
-    EXPECT_EQ(Fields(executor.GetRunProgress()), (F{1, 31, direct, 2, 0, 7, 6u, 3u}));
+    EXPECT_EQ(Fields(executor.GetRunProgress()), (F{1, 31, direct, 2, 0, 7, 1, 6u, 3u}));
     executor.RemovePatrol(PATROL_EXEC_DIRECT);
     ASSERT_TRUE(WaitForMoves(7));
-    EXPECT_EQ(Fields(executor.GetRunProgress()), (F{1, 32, guard, 3, 0, 5, 7u, 4u}));
+    EXPECT_EQ(Fields(executor.GetRunProgress()), (F{1, 32, guard, 3, 0, 5, 1, 7u, 4u}));
 }
 
 // Patrol 40 visits 100, 101, 102 and patrol 41 visits 200 .. 204, so a
@@ -103,7 +103,8 @@ TEST_F(RunProgressTest, ReadersRacingRunsSeeOnlyWholeSnapshots) {
                 whole = whole && (p.patrolId == 40 || p.patrolId == 41) && p.presetCount == count &&
                         p.type == PATROL_EXEC_DIRECT && p.presetIndex >= -1 &&
                         p.presetIndex < p.presetCount &&
-                        p.position == (p.presetIndex < 0 ? 0 : base + p.presetIndex);
+                        p.position == (p.presetIndex < 0 ? 0 : base + p.presetIndex) &&
+                        p.presetIndex == (p.runMoves == 0 ? -1 : (p.runMoves - 1) % p.presetCount);
             }
             if (!whole) ++faults;
             if (p.moves != moves) ++changes;

@@ -39,44 +39,41 @@ public:
     void Know(const Patrol& patrol) { patrols_[patrol.GetId()] = patrol; }
 
     // Reads the progress once and prints what changed since the last look.
+    // Moves that came and went between two looks (a stay of 0, the closing
+    // move of a run and the first of the next) are told from the counters.
     PATROL_RUN_PROGRESS Look() {
         const PATROL_RUN_PROGRESS p = executor_.GetRunProgress();
+        const unsigned int fresh = p.moves - last_.moves;
         if (p.runs != last_.runs) {
-            if (last_.running) {  // the run in progress gave way to another request
-                Out::Emit(ClockText() + "  run " + std::to_string(last_.runs) + " gave way after " +
-                              std::to_string(runMoves_) + " moves",
-                          {{"event", "end"},
-                           {"time", IsoTime()},
-                           {"run", last_.runs},
-                           {"patrol", last_.patrolId},
-                           {"type", TypeName(last_.type)},
-                           {"moves", runMoves_},
-                           {"complete", false},
-                           {"displaced", true}});
-            }
-            runMoves_ = 0;
+            // The rest of the run seen last, then its end.
+            const unsigned int inNew = static_cast<unsigned int>(p.runMoves);
+            const unsigned int rest = fresh > inNew && last_.runs == p.runs - 1 ? fresh - inNew : 0;
+            for (unsigned int k = 1; k <= rest; ++k)
+                Moved(last_, last_.runMoves + static_cast<int>(k));
+            if (last_.runs > 0 && (last_.running || rest > 0))
+                RunEnded(last_, last_.runMoves + static_cast<int>(rest));
             RunStarted(p);
+            for (int k = 1; k <= p.runMoves; ++k) Moved(p, k);
+        } else {
+            for (int k = last_.runMoves + 1; k <= p.runMoves; ++k) Moved(p, k);
+            if (last_.running && !p.running) RunEnded(p, p.runMoves);
         }
-        if (p.moves != last_.moves) {
-            runMoves_ += p.moves - last_.moves;
-            Moved(p);
-        }
-        if (last_.running && !p.running) RunEnded(p);
         last_ = p;
         return p;
     }
-    unsigned int RunMoves() const { return runMoves_; }
+    int RunMoves() const { return last_.runMoves; }
 
 private:
     std::string PatrolName(int id) const {
         auto it = patrols_.find(id);
         return it == patrols_.end() ? std::string() : it->second.GetName();
     }
-    std::string PresetName(int id, int index) const {
+    // Position and name of preset `index` of patrol `id` as this process loaded it.
+    PRESET_INFO Preset(int id, int index) const {
         auto it = patrols_.find(id);
         PRESET_INFO preset{0, ""};
-        if (it == patrols_.end() || it->second.GetPresetFromList(index, &preset) != 0) return "";
-        return preset.name;
+        if (it != patrols_.end()) it->second.GetPresetFromList(index, &preset);
+        return preset;
     }
 
     void RunStarted(const PATROL_RUN_PROGRESS& p) {
@@ -98,21 +95,34 @@ private:
                    {"stay", stay}});
     }
 
-    void Moved(const PATROL_RUN_PROGRESS& p) {
-        const bool closing = p.presetIndex == 0 && runMoves_ > 1;
-        const std::string name = PresetName(p.patrolId, p.presetIndex);
-        json j = {{"event", "move"},        {"time", IsoTime()},      {"mono", Monotonic()},
-                  {"run", p.runs},          {"patrol", p.patrolId},   {"type", TypeName(p.type)},
-                  {"index", p.presetIndex}, {"count", p.presetCount}, {"position", p.position},
-                  {"name", name},           {"moves", p.moves},       {"closing", closing}};
-        std::string text =
-            ClockText() + "  " + TypeName(p.type) + "  patrol " + std::to_string(p.patrolId) +
-            "  preset " + std::to_string(p.presetIndex + 1) + " of " +
-            std::to_string(p.presetCount) + "  position " + std::to_string(p.position) +
-            (name.empty() ? "" : "  " + name) + (closing ? "  (back to the first preset)" : "");
+    // The k-th move (1-based) of the run that `p` describes.
+    void Moved(const PATROL_RUN_PROGRESS& p, int k) {
+        const bool closing = k == p.presetCount + 1;
+        const int index = closing ? 0 : k - 1;
+        const PRESET_INFO preset = Preset(p.patrolId, index);
+        const int position = k == p.runMoves ? p.position : preset.position;
+        json j = {{"event", "move"},
+                  {"time", IsoTime()},
+                  {"mono", Monotonic()},
+                  {"run", p.runs},
+                  {"patrol", p.patrolId},
+                  {"type", TypeName(p.type)},
+                  {"index", index},
+                  {"count", p.presetCount},
+                  {"position", position},
+                  {"name", preset.name},
+                  {"moves", p.moves - static_cast<unsigned int>(p.runMoves - k)},
+                  {"closing", closing}};
+        std::string text = ClockText() + "  " + TypeName(p.type) + "  patrol " +
+                           std::to_string(p.patrolId) + "  preset " + std::to_string(index + 1) +
+                           " of " + std::to_string(p.presetCount) + "  position " +
+                           std::to_string(position) +
+                           (preset.name.empty() ? "" : "  " + preset.name) +
+                           (closing ? "  (back to the first preset)" : "");
         if (!snapshotDir_.empty()) {
             char file[64];
-            snprintf(file, sizeof file, "/%03u-run%u-p%d.jpg", p.moves, p.runs, p.position);
+            snprintf(file, sizeof file, "/%03u-run%u-p%d.jpg",
+                     static_cast<unsigned int>(j["moves"]), p.runs, position);
             auto it = patrols_.find(p.patrolId);
             try {
                 const Camera camera = LoadCamera(it == patrols_.end() ? 0 : it->second.GetCamId());
@@ -127,25 +137,25 @@ private:
         Out::Emit(text, j);
     }
 
-    void RunEnded(const PATROL_RUN_PROGRESS& p) {
-        const bool complete = runMoves_ == static_cast<unsigned int>(p.presetCount) + 1;
+    // The end of the run that `p` describes, after `moves` moves.
+    void RunEnded(const PATROL_RUN_PROGRESS& p, int moves) {
+        const bool complete = moves == p.presetCount + 1;
         Out::Emit(ClockText() + "  run " + std::to_string(p.runs) + " ended after " +
-                      std::to_string(runMoves_) + " moves" +
-                      (complete ? "" : " (not a whole tour)"),
+                      std::to_string(moves) + " moves" +
+                      (complete ? "" : " (gave way, or a move failed)"),
                   {{"event", "end"},
                    {"time", IsoTime()},
                    {"run", p.runs},
                    {"patrol", p.patrolId},
                    {"type", TypeName(p.type)},
-                   {"moves", runMoves_},
+                   {"moves", moves},
                    {"complete", complete}});
     }
 
     PatrolExecutor& executor_;
     std::string snapshotDir_;
     std::map<int, Patrol> patrols_;
-    PATROL_RUN_PROGRESS last_ = {0, 0, PATROL_EXEC_NONE, 0, -1, 0, 0, 0};
-    unsigned int runMoves_ = 0;
+    PATROL_RUN_PROGRESS last_ = {0, 0, PATROL_EXEC_NONE, 0, -1, 0, 0, 0, 0};
 };
 
 // The camera of a patrol, checked to answer (its presets are read).
@@ -184,7 +194,7 @@ int Run(int patrolId, const RunOptions& options) {
             throw Error{kDbError, "the executor did not start patrol " + std::to_string(patrolId)};
         if (p.runs > 0 && !p.running) break;
     }
-    if (watcher.RunMoves() == static_cast<unsigned int>(patrol.GetPresetListNum()) + 1) return kOk;
+    if (watcher.RunMoves() == patrol.GetPresetListNum() + 1) return kOk;
     // A move failed: tell why if the camera says so.
     CheckedCamera(patrol);
     throw Error{kCameraRefused, "camera " + std::to_string(camera.GetId()) +
