@@ -167,6 +167,8 @@ TEST_F(ToolTest, FailuresGiveTheirExitCodeAndOneLine) {
     const std::string wrong = AddCamera("wrong");
     const std::string silent = AddCamera("secret", "1");  // nothing listens on port 1
     const std::string cam = AddCamera();
+    pgtest::Exec("INSERT INTO patrol (id, camId, name, stayTime) VALUES (50, " + silent +
+                 ", 's', 1), (51, " + wrong + ", 'w', 1);");
     struct Case {
         std::vector<std::string> args, env;
         int code;
@@ -202,6 +204,8 @@ TEST_F(ToolTest, FailuresGiveTheirExitCodeAndOneLine) {
         {{"presets", wrong}, {}, 77, "password refused"},
         {{"snapshot", wrong}, {}, 77, "password refused"},
         {{"presets", silent}, {}, 68, "no answer"},
+        {{"run", "50"}, {}, 68, "no answer"},
+        {{"guard", "51", "--mode", "any"}, {}, 77, "password refused"},
         {{"patrol", "create", silent, "n", "--stay", "1", "1"}, {}, 68, "no answer"},
         {{"snapshot", cam, "-o", "/nonexistent/x.jpg"}, {}, 73, "/nonexistent/x.jpg"},
     };

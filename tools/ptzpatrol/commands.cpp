@@ -149,18 +149,18 @@ int Presets(int camId) {
 }
 
 int PatrolCreate(int camId, const std::string& name, int stay,
-                 const std::vector<std::string>& specs) {
+                 const std::vector<std::string>& presetArgs) {
     if (stay < 0 || stay > 2147) throw Error{kUsage, "--stay must be 0 to 2147 seconds"};
     std::vector<PRESET_INFO> presets;
-    for (const std::string& spec : specs) {
-        const size_t colon = spec.find(':');
-        const std::string number = spec.substr(0, colon);
+    for (const std::string& given : presetArgs) {
+        const size_t colon = given.find(':');
+        const std::string number = given.substr(0, colon);
         char* end = nullptr;
         const long position = strtol(number.c_str(), &end, 10);
         if (number.empty() || *end != '\0' || position < INT32_MIN || position > INT32_MAX)
-            throw Error{kUsage, "a preset is POSITION or POSITION:NAME, not '" + spec + "'"};
+            throw Error{kUsage, "a preset is POSITION or POSITION:NAME, not '" + given + "'"};
         presets.push_back({static_cast<int>(position),
-                           colon == std::string::npos ? std::string() : spec.substr(colon + 1)});
+                           colon == std::string::npos ? std::string() : given.substr(colon + 1)});
     }
     RequireDatabase(true);
     const Camera camera = LoadCamera(camId);

@@ -20,10 +20,13 @@ using Clock = std::chrono::steady_clock;
 
 constexpr auto kPoll = std::chrono::milliseconds(10);  // how often the run's progress is read
 
-// Loads a patrol as the executor will (its presets checked against the camera).
-Patrol LoadPatrol(int id) {
-    if (Query("SELECT id FROM patrol WHERE id = " + itos(id) + ";", {"id"}).empty())
-        throw Error{kUnknownId, "no patrol " + std::to_string(id)};
+// Loads a patrol as the executor will (its presets checked against the
+// camera). With `checkCamera`, the camera must answer first: a camera that
+// does not fails at once with its own error, not after the load's wait.
+Patrol LoadPatrol(int id, bool checkCamera) {
+    const auto rows = Query("SELECT camId FROM patrol WHERE id = " + itos(id) + ";", {"camId"});
+    if (rows.empty()) throw Error{kUnknownId, "no patrol " + std::to_string(id)};
+    if (checkCamera) CameraPresets(LoadCamera(atoi(rows[0][0].c_str())));
     Patrol patrol;
     if (patrol.Load(id) != 0)
         throw Error{kDbError, "loading patrol " + std::to_string(id) + " failed"};
@@ -158,19 +161,12 @@ private:
     PATROL_RUN_PROGRESS last_ = {0, 0, PATROL_EXEC_NONE, 0, -1, 0, 0, 0, 0};
 };
 
-// The camera of a patrol, checked to answer (its presets are read).
-Camera CheckedCamera(const Patrol& patrol) {
-    const Camera camera = LoadCamera(patrol.GetCamId());
-    CameraPresets(camera);
-    return camera;
-}
-
 }  // namespace
 
 int Run(int patrolId, const RunOptions& options) {
     RequireDatabase(true);
-    const Patrol patrol = LoadPatrol(patrolId);
-    const Camera camera = CheckedCamera(patrol);
+    const Patrol patrol = LoadPatrol(patrolId, true);
+    const Camera camera = LoadCamera(patrol.GetCamId());
     if (patrol.GetPresetListNum() == 0)
         throw Error{kUnknownId,
                     "patrol " + std::to_string(patrolId) + " has no presets the camera has"};
@@ -196,7 +192,7 @@ int Run(int patrolId, const RunOptions& options) {
     }
     if (watcher.RunMoves() == patrol.GetPresetListNum() + 1) return kOk;
     // A move failed: tell why if the camera says so.
-    CheckedCamera(patrol);
+    CameraPresets(camera);
     throw Error{kCameraRefused, "camera " + std::to_string(camera.GetId()) +
                                     " refused a move after " + std::to_string(watcher.RunMoves()) +
                                     " moves (see the system log)"};
@@ -216,8 +212,7 @@ int Guard(int patrolId, const GuardOptions& o) {
     if (o.eventValidSeconds < 0 || o.eventValidSeconds > 2147)
         throw Error{kUsage, "--event-valid must be 0 to 2147 seconds"};
     RequireDatabase(true);
-    const Patrol patrol = LoadPatrol(patrolId);
-    CheckedCamera(patrol);
+    const Patrol patrol = LoadPatrol(patrolId, true);
     CatchStopSignals();
 
     PatrolExecutor executor;
@@ -257,7 +252,7 @@ int Guard(int patrolId, const GuardOptions& o) {
             executor.RemovePatrol(PATROL_EXEC_DIRECT);
         } else if (word == "direct" && !arg.empty()) {
             try {
-                const Patrol direct = LoadPatrol(atoi(arg.c_str()));
+                const Patrol direct = LoadPatrol(atoi(arg.c_str()), false);
                 watcher.Know(direct);
                 executor.Execute(direct.GetId(), PATROL_EXEC_DIRECT);
             } catch (const Error& e) {
