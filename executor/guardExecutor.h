@@ -74,6 +74,9 @@ public:
     // hold-off); a tour in progress on the executor runs on. 0: done; -1: the
     // thread was not running.
     int Terminate();
+    // The guard's state (GUARD_STATE_*), read without waiting for the guard
+    // thread. Any thread.
+    int GetState() const { return state.load(); }
 
 private:
     friend struct GuardExecutorPeer;  // unit tests read the state through it

@@ -2,6 +2,7 @@
 // the moves of one run.
 #include "executor/patrolExecutor.h"
 
+#include <sched.h>
 #include <syslog.h>
 
 #include <cstdint>
@@ -32,7 +33,17 @@ PatrolExecutor::PatrolExecutor()
       execType(PATROL_EXEC_NONE),
       command(PATROL_CMD_NONE),
       thread(),
-      threadStarted(false) {
+      threadStarted(false),
+      progressSeq(0),
+      progressRunning(0),
+      progressPatrolId(0),
+      progressType(PATROL_EXEC_NONE),
+      progressCount(0),
+      progressIndex(-1),
+      progressPosition(0),
+      progressRunMoves(0),
+      progressMoves(0),
+      progressRuns(0) {
     pthread_mutex_init(&mutex, nullptr);
     InitWorkerCond(&wake);
     const int rc = StartWorkerThread(&thread, ThreadFuncExcute, this);
@@ -71,6 +82,35 @@ int PatrolExecutor::RemovePatrol(PATROL_EXEC_TYPE type) {
 }
 
 int PatrolExecutor::GetStatus() { return status.load(); }
+
+// A sequence lock over atomics. The worker (the only writer) makes the counter
+// odd, stores the fields with release (so the odd counter is visible before
+// any of them) and makes it even again with release. A reader loads the
+// counter with acquire, the fields with acquire (so the second load of the
+// counter cannot come before them) and the counter again: the same even value
+// both times means no write overlapped the copy.
+PATROL_RUN_PROGRESS PatrolExecutor::GetRunProgress() const {
+    constexpr auto acquire = std::memory_order_acquire;
+    PATROL_RUN_PROGRESS p;
+    for (unsigned int attempt = 1;; ++attempt) {
+        const unsigned int before = progressSeq.load(acquire);
+        if ((before & 1u) == 0) {
+            p.running = progressRunning.load(acquire);
+            p.patrolId = progressPatrolId.load(acquire);
+            p.type = static_cast<PATROL_EXEC_TYPE>(progressType.load(acquire));
+            p.presetCount = progressCount.load(acquire);
+            p.presetIndex = progressIndex.load(acquire);
+            p.position = progressPosition.load(acquire);
+            p.runMoves = progressRunMoves.load(acquire);
+            p.moves = progressMoves.load(acquire);
+            p.runs = progressRuns.load(acquire);
+            if (progressSeq.load(std::memory_order_relaxed) == before) return p;
+        }
+        // A write takes a few stores; only a worker preempted in the middle
+        // of one keeps a reader here, and then the reader gives way.
+        if (attempt % 64 == 0) sched_yield();
+    }
+}
 
 void* PatrolExecutor::ThreadFuncExcute(void* arg) {
     PatrolExecutor* self = static_cast<PatrolExecutor*>(arg);
@@ -160,6 +200,7 @@ int PatrolExecutor::ChangeExcutePatrol(Patrol& patrol) {
             if (result == 0) {
                 execType = type;
                 status = PATROL_STATUS_RUNNING;
+                PublishRunStart(patrol, type);
             }
             return result;
         }
@@ -172,6 +213,7 @@ int PatrolExecutor::ChangeExcutePatrol(Patrol& patrol) {
     ClearPatrolData(patrolId, type);
     execType = PATROL_EXEC_NONE;
     status = PATROL_STATUS_IDLE;
+    PublishRunEnd();
     return result;
 }
 
@@ -295,6 +337,7 @@ int PatrolExecutor::ExecPatrol(Patrol& patrol, int& presetIndex, bool& tourDone)
         return -1;
     }
     releaseCameraAPI(api);
+    PublishMove(presetIndex, preset.position);
 
     if (tourDone) return -1;  // the closing move back to the first preset
     ++presetIndex;
@@ -311,4 +354,55 @@ void PatrolExecutor::ExecFinish(int patrolId) {
     ClearPatrolData(patrolId, execType);
     execType = PATROL_EXEC_NONE;
     status = PATROL_STATUS_IDLE;
+    PublishRunEnd();
+}
+
+// ---- run progress (worker thread only; see GetRunProgress) ----
+
+namespace {
+
+// Makes the counter odd on construction and even again on destruction.
+class ProgressWrite {
+public:
+    explicit ProgressWrite(std::atomic<unsigned int>& seq) : seq_(seq) {
+        seq_.store(seq_.load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
+    }
+    ~ProgressWrite() {
+        seq_.store(seq_.load(std::memory_order_relaxed) + 1, std::memory_order_release);
+    }
+    ProgressWrite(const ProgressWrite&) = delete;
+    ProgressWrite& operator=(const ProgressWrite&) = delete;
+
+private:
+    std::atomic<unsigned int>& seq_;
+};
+
+constexpr auto kRelease = std::memory_order_release;
+
+}  // namespace
+
+void PatrolExecutor::PublishRunStart(const Patrol& patrol, PATROL_EXEC_TYPE type) {
+    ProgressWrite write(progressSeq);
+    progressRunning.store(1, kRelease);
+    progressPatrolId.store(patrol.GetId(), kRelease);
+    progressType.store(type, kRelease);
+    progressCount.store(patrol.GetPresetListNum(), kRelease);
+    progressIndex.store(-1, kRelease);
+    progressPosition.store(0, kRelease);
+    progressRunMoves.store(0, kRelease);
+    progressRuns.store(progressRuns.load(std::memory_order_relaxed) + 1, kRelease);
+}
+
+void PatrolExecutor::PublishMove(int presetIndex, int position) {
+    ProgressWrite write(progressSeq);
+    progressIndex.store(presetIndex, kRelease);
+    progressPosition.store(position, kRelease);
+    progressRunMoves.store(progressRunMoves.load(std::memory_order_relaxed) + 1, kRelease);
+    progressMoves.store(progressMoves.load(std::memory_order_relaxed) + 1, kRelease);
+}
+
+void PatrolExecutor::PublishRunEnd() {
+    if (progressRunning.load(std::memory_order_relaxed) == 0) return;  // nothing to end
+    ProgressWrite write(progressSeq);
+    progressRunning.store(0, kRelease);
 }

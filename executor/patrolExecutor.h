@@ -34,6 +34,37 @@ enum {
     PATROL_CMD_REMOVE_GUARD = 4
 };
 
+// The run of an executor, as GetRunProgress copies it out: one consistent
+// snapshot, written only by the worker at the start of a run, at each move the
+// camera accepted and at the end of a run.
+typedef struct __tag_PATROL_RUN_PROGRESS {
+    // 1 while a run is in progress (status RUNNING), else 0. The fields below
+    // then describe the run that ended last, as it ended (all 0, presetIndex
+    // -1 and type NONE before the first run).
+    int running;
+    int patrolId;           // patrol of the run
+    PATROL_EXEC_TYPE type;  // who asked for it: GUARD or DIRECT
+    int presetCount;        // presets of the run's patrol
+    // Index (0-based, < presetCount) of the preset the camera was last sent to
+    // in this run: the one it stays at. -1 until the run's first move. The
+    // closing move of a tour goes back to index 0.
+    int presetIndex;
+    int position;  // the camera's preset number of presetIndex; 0 while it is -1
+    // Moves the camera accepted in this run: 0 at its start, presetCount + 1
+    // once the tour closed. The k-th move of a run goes to index k - 1, the
+    // last (k = presetCount + 1) back to index 0: with `moves` a poller that
+    // missed some can tell which they were.
+    int runMoves;
+    // Moves the camera accepted on this executor since it was constructed,
+    // closing moves included. Monotonic (wraps at 2^32): a poller that sees it
+    // change by one has seen every move.
+    unsigned int moves;
+    // Runs started on this executor since it was constructed, monotonic: a
+    // new run of the same patrol (a guard repeat, or a guard run started again
+    // after a direct one) shows as a change here.
+    unsigned int runs;
+} PATROL_RUN_PROGRESS;
+
 // Runs at most one patrol at a time on its own worker thread. While a run is
 // in progress the worker makes one pass every 250 ms; an idle worker sleeps
 // until a command is posted and acts on it at once. A pass takes the command,
@@ -65,6 +96,11 @@ public:
     int RemovePatrol(PATROL_EXEC_TYPE type);
     // PATROL_STATUS_IDLE, _LOADING or _RUNNING.
     int GetStatus();
+    // The run in progress (or the last one), copied out as one consistent
+    // snapshot. Never waits for the worker: it reads atomics and retries only
+    // while the worker is in the middle of its few stores. Any thread. A run
+    // displaced by another request is shown until the new run starts.
+    PATROL_RUN_PROGRESS GetRunProgress() const;
 
 private:
     static void* ThreadFuncExcute(void* arg);
@@ -90,6 +126,10 @@ private:
     // -2: presetIndex out of range.
     int ExecPatrol(Patrol& patrol, int& presetIndex, bool& tourDone);
     void ExecFinish(int patrolId);
+    // Writes the run progress (worker thread only): a new run, a move, or the end.
+    void PublishRunStart(const Patrol& patrol, PATROL_EXEC_TYPE type);
+    void PublishMove(int presetIndex, int position);
+    void PublishRunEnd();
 
     // Request slots, indexed by GUARD and DIRECT; 0 means none. Guarded by mutex.
     int requestId[2];
@@ -110,6 +150,12 @@ private:
     // Whether pthread_create succeeded (the destructor joins only a started
     // worker). Set by the constructor only.
     bool threadStarted;
+    // Run progress: a sequence counter (odd while the worker writes) over
+    // atomic fields, written by the worker only, read by GetRunProgress.
+    std::atomic<unsigned int> progressSeq;
+    std::atomic<int> progressRunning, progressPatrolId, progressType, progressCount;
+    std::atomic<int> progressIndex, progressPosition, progressRunMoves;
+    std::atomic<unsigned int> progressMoves, progressRuns;
 };
 
 #endif  // EXECUTOR_PATROLEXECUTOR_H

@@ -12,6 +12,7 @@ struct CameraSettings {
     std::string host;
     int port = 0;
     std::string username, password, vendor, model, channel, path, liveReso;
+    int snapshotType = 1;  // user-defined camera: 1 single image, 2 multipart stream at path
 };
 
 // A camera's stored record. Load fills it from the camera table.
@@ -67,7 +68,9 @@ CameraAPI* newCameraAPI(const std::string& host, int port, const std::string& us
                         const std::string& model, const std::string& channel);
 
 // Control object for a generic HTTP camera that serves images at `path`;
-// `type` is the fetch type as decimal text ("1" or "2").
+// `type` is the fetch type as decimal text ("1" or "2"). With "1", a camera
+// whose record (read by Camera::Load in this process) has this host, port and
+// path and snapshot type 2 is read as a multipart stream.
 CameraAPI* newUserDefinedAPI(const std::string& host, int port, const std::string& username,
                              const std::string& password, const std::string& path,
                              const std::string& type);

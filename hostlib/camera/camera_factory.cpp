@@ -2,10 +2,23 @@
 // the user-defined generic HTTP camera.
 #include <strings.h>
 
+#include <map>
+#include <mutex>
+#include <tuple>
+
 #include "host/camera.h"
 #include "hostlib/camera/onvif_camera.h"
+#include "hostlib/camera/user_defined.h"
 
 namespace {
+
+using StreamKey = std::tuple<std::string, int, std::string>;  // host, port, path
+
+std::mutex gStreamsMu;
+std::map<StreamKey, int>& Streams() {  // only the streams: type 2
+    static auto* streams = new std::map<StreamKey, int>;
+    return *streams;
+}
 
 // A generic HTTP camera without PTZ that serves images at a fixed path.
 class UserDefinedCamera : public CameraAPI {
@@ -41,9 +54,23 @@ CameraAPI* newCameraAPI(const std::string& host, int port, const std::string& us
     return onvif::NewOnvifCamera(host, port, username, password, channel);
 }
 
-CameraAPI* newUserDefinedAPI(const std::string& /*host*/, int /*port*/,
-                             const std::string& /*username*/, const std::string& /*password*/,
-                             const std::string& path, const std::string& type) {
+void HostNoteSnapshotType(const std::string& host, int port, const std::string& path, int type) {
+    std::lock_guard<std::mutex> lock(gStreamsMu);
+    if (type == 2) {
+        Streams()[StreamKey(host, port, path)] = type;
+    } else {
+        Streams().erase(StreamKey(host, port, path));
+    }
+}
+
+CameraAPI* newUserDefinedAPI(const std::string& host, int port, const std::string& /*username*/,
+                             const std::string& /*password*/, const std::string& path,
+                             const std::string& type) {
+    if (type == "1") {
+        std::lock_guard<std::mutex> lock(gStreamsMu);
+        if (Streams().count(StreamKey(host, port, path)) != 0)
+            return new UserDefinedCamera(path, "2");
+    }
     return new UserDefinedCamera(path, type);
 }
 

@@ -3,9 +3,11 @@
 
 #include <curl/curl.h>
 #include <stdlib.h>
+#include <strings.h>
 #include <sys/random.h>
 #include <time.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <map>
@@ -13,8 +15,8 @@
 #include <mutex>
 #include <vector>
 
-#include "hostlib/http/curl_global.h"
 #include "hostlib/camera/onvif_soap.h"
+#include "hostlib/http/curl_global.h"
 
 namespace onvif {
 namespace {
@@ -36,6 +38,7 @@ struct Discovery {
     long clockOffset = 0;                         // camera UTC minus local clock, seconds
     std::map<int, std::string> textTokens;        // negative position -> token
     std::map<std::string, std::string> snapshot;  // profile -> snapshot URI
+    std::map<std::string, int> snapshotType;      // profile -> fetch type, once probed
 };
 
 struct CameraEntry {
@@ -67,6 +70,22 @@ size_t Collect(char* data, size_t size, size_t n, void* out) {
     s->append(data, size * n);
     return size * n;
 }
+
+thread_local Diagnosis tLastDiagnosis;
+
+// Headers of a probe: the Content-Type, lower case.
+size_t ProbeHeader(char* data, size_t size, size_t n, void* out) {
+    std::string line(data, size * n);
+    if (strncasecmp(line.c_str(), "content-type:", 13) == 0) {
+        std::string value = line.substr(13);
+        for (char& c : value) c = static_cast<char>(tolower(static_cast<unsigned char>(c)));
+        *static_cast<std::string*>(out) = value;
+    }
+    return size * n;
+}
+
+// The body of a probe is not wanted: the first byte ends the transfer.
+size_t ProbeBody(char*, size_t, size_t, void*) { return 0; }
 
 // kRefused: the camera failed the request (a fault, an error status, a reply
 // we cannot read), which kept knowledge may explain; kAbsent: the camera's
@@ -111,7 +130,9 @@ public:
     int GetSnapshotPath(std::string& path, int& port, int& type) override {
         return Run([&](Discovery& d) {
             const Reply::Profile* profile = SnapshotProfile(d);
-            if (!profile) return Outcome::kRefused;
+            if (!profile)
+                return Fail(Failure::kRefused,
+                            "no media profile on channel " + std::to_string(channel_));
             std::string uri;
             auto cached = d.snapshot.find(profile->token);
             if (cached != d.snapshot.end()) {
@@ -126,10 +147,21 @@ public:
                 Store(d);
             }
             auto u = ParseUrl(uri);
-            if (!u || u->scheme != "http") return Outcome::kRefused;
+            if (!u || u->scheme != "http")
+                return Fail(Failure::kRefused, "snapshot URI is not http: " + uri);
             path = u->path;
             port = (u->host == d.internalHost && u->port == d.internalPort) ? port_ : u->port;
-            type = 1;
+            auto known = d.snapshotType.find(profile->token);
+            if (known != d.snapshotType.end()) {
+                type = known->second;
+            } else {
+                type = ProbeSnapshotType(port, path);
+                if (type > 0) {
+                    d.snapshotType[profile->token] = type;
+                    Store(d);
+                }
+                if (type < 0) type = 1;  // not known: the fetch itself will tell
+            }
             return Outcome::kOk;
         });
     }
@@ -144,12 +176,12 @@ public:
                     Outcome o = FetchPresets(d, list);
                     if (o != Outcome::kOk) return o;
                     it = d.textTokens.find(position);
-                    if (it == d.textTokens.end()) return Outcome::kAbsent;
+                    if (it == d.textTokens.end()) return Absent(position);
                 }
                 token = it->second;
             }
             const Reply::Profile* profile = PtzProfile(d);
-            if (!profile || d.ptzPath.empty()) return Outcome::kRefused;
+            if (!profile || d.ptzPath.empty()) return NoPtz();
             Reply reply;
             return Call(d.ptzPath, GotoPresetBody(profile->token, token), true, d.clockOffset,
                         reply);
@@ -162,6 +194,20 @@ private:
     // with kept knowledge, forgets it, discovers afresh and tries once more.
     template <class Op>
     int Run(Op op) {
+        problem_ = Diagnosis();
+        const int rc = RunOnce(op);
+        if (rc == 0) {
+            tLastDiagnosis = Diagnosis();
+        } else {
+            if (problem_.failure == Failure::kNone)
+                problem_ = {Failure::kRefused, "unexpected reply"};
+            tLastDiagnosis = problem_;
+        }
+        return rc;
+    }
+
+    template <class Op>
+    int RunOnce(Op op) {
         deadline_ = Clock::now() + std::chrono::milliseconds(gCallTimeoutMs.load());
         Discovery d;
         {
@@ -222,7 +268,7 @@ private:
             }
         }
         auto media = ParseUrl(a.media);
-        if (!media) return Outcome::kRefused;
+        if (!media) return Fail(Failure::kRefused, "no media service reported");
         d.mediaPath = media->path;
         d.internalHost = media->host;
         d.internalPort = media->port;
@@ -232,7 +278,7 @@ private:
         o = Call(d.mediaPath, GetProfilesBody(), true, d.clockOffset, reply);
         if (o != Outcome::kOk) return o;
         d.profiles = reply.Profiles();
-        if (d.profiles.empty()) return Outcome::kRefused;
+        if (d.profiles.empty()) return Fail(Failure::kRefused, "no media profile");
         d.valid = true;
         Store(d);
         return Outcome::kOk;
@@ -272,11 +318,12 @@ private:
 
     Outcome FetchPresets(Discovery& d, std::vector<Reply::Preset>& list) {
         const Reply::Profile* profile = PtzProfile(d);
-        if (!profile || d.ptzPath.empty()) return Outcome::kRefused;
+        if (!profile || d.ptzPath.empty()) return NoPtz();
         Reply reply;
         Outcome o = Call(d.ptzPath, GetPresetsBody(profile->token), true, d.clockOffset, reply);
         if (o != Outcome::kOk) return o;
-        if (!reply.Is(kNsPtz, "GetPresetsResponse")) return Outcome::kRefused;
+        if (!reply.Is(kNsPtz, "GetPresetsResponse"))
+            return Fail(Failure::kRefused, "GetPresets: unexpected reply");
         list = reply.Presets();
         d.textTokens.clear();
         for (const auto& e : MapPresets(list))
@@ -291,7 +338,11 @@ private:
         long left = static_cast<long>(
             std::chrono::duration_cast<std::chrono::milliseconds>(deadline_ - Clock::now())
                 .count());
-        if (left <= 0) return Outcome::kTransport;
+        if (left <= 0) {
+            Fail(Failure::kUnreachable,
+                 "no answer within " + std::to_string(gCallTimeoutMs.load()) + " ms");
+            return Outcome::kTransport;
+        }
         std::string xml;
         if (sign && !user_.empty()) {
             UsernameToken token;
@@ -367,10 +418,84 @@ private:
         }
         if (curl) curl_easy_cleanup(curl);
 
-        if (rc != CURLE_OK) return Outcome::kTransport;
-        if (!reply.Parse(text) || reply.IsFault()) return Outcome::kRefused;
-        if (status < 200 || status > 299) return Outcome::kRefused;
+        const std::string action = ActionOf(body);
+        const std::string what = action.substr(action.rfind('/') + 1);
+        if (rc != CURLE_OK) {
+            // No connection, or no answer in time; otherwise the camera
+            // answered and broke off.
+            const bool silent = rc == CURLE_COULDNT_CONNECT || rc == CURLE_COULDNT_RESOLVE_HOST ||
+                                rc == CURLE_OPERATION_TIMEDOUT;
+            Fail(silent ? Failure::kUnreachable : Failure::kRefused,
+                 url + ": " + curl_easy_strerror(rc));
+            return Outcome::kTransport;
+        }
+        if (status == 401 || status == 403)
+            return Fail(Failure::kUnauthorized, what + ": HTTP " + std::to_string(status));
+        if (!reply.Parse(text))
+            return Fail(Failure::kRefused,
+                        what + ": HTTP " + std::to_string(status) + ", not a SOAP reply");
+        if (reply.IsFault()) {
+            const Fault& f = reply.GetFault();
+            const bool auth = (f.subcode + f.code).find("NotAuthorized") != std::string::npos;
+            return Fail(auth ? Failure::kUnauthorized : Failure::kRefused,
+                        what + ": SOAP fault " + (f.subcode.empty() ? f.code : f.subcode) +
+                            (f.reason.empty() ? "" : " (" + f.reason + ")"));
+        }
+        if (status < 200 || status > 299)
+            return Fail(Failure::kRefused, what + ": HTTP " + std::to_string(status));
         return Outcome::kOk;
+    }
+
+    // Notes why the call fails: the latest failure explains it best, except
+    // that a refused credential is not hidden by what follows from it (no
+    // service address when GetServices and GetCapabilities were refused).
+    Outcome Fail(Failure failure, const std::string& detail) {
+        if (!(problem_.failure == Failure::kUnauthorized && failure == Failure::kRefused))
+            problem_ = {failure, detail};
+        return Outcome::kRefused;
+    }
+    Outcome NoPtz() {
+        return Fail(Failure::kRefused, "no PTZ unit on channel " + std::to_string(channel_));
+    }
+    Outcome Absent(int position) {
+        problem_ = {Failure::kNoSuchPreset, "the camera has no preset " + std::to_string(position)};
+        return Outcome::kAbsent;
+    }
+
+    // What the snapshot URI serves, from the Content-Type of its response: 2
+    // for a multipart stream (some cameras give their MJPEG stream as the
+    // snapshot URI), 1 for anything else; -1 when no response came. One GET
+    // within the call's time bound, ended at the first body byte.
+    int ProbeSnapshotType(int port, const std::string& path) {
+        long left = static_cast<long>(
+            std::chrono::duration_cast<std::chrono::milliseconds>(deadline_ - Clock::now())
+                .count());
+        if (left <= 0) return -1;
+        CURL* curl = curl_easy_init();
+        if (!curl) return -1;
+        std::string url = "http://" +
+                          (host_.find(':') != std::string::npos ? "[" + host_ + "]" : host_) + ":" +
+                          std::to_string(port) + path;
+        std::string contentType;
+        curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
+        curl_easy_setopt(curl, CURLOPT_HEADERFUNCTION, ProbeHeader);
+        curl_easy_setopt(curl, CURLOPT_HEADERDATA, &contentType);
+        curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, ProbeBody);
+        curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
+        curl_easy_setopt(curl, CURLOPT_TIMEOUT_MS, left);
+        curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT_MS, std::min(left, kConnectTimeoutMs));
+        curl_easy_setopt(curl, CURLOPT_NOPROXY, "*");
+        if (!user_.empty()) {
+            curl_easy_setopt(curl, CURLOPT_HTTPAUTH, CURLAUTH_DIGEST | CURLAUTH_BASIC);
+            curl_easy_setopt(curl, CURLOPT_USERNAME, user_.c_str());
+            curl_easy_setopt(curl, CURLOPT_PASSWORD, password_.c_str());
+        }
+        const CURLcode rc = curl_easy_perform(curl);
+        long status = 0;
+        curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
+        curl_easy_cleanup(curl);
+        if ((rc != CURLE_OK && rc != CURLE_WRITE_ERROR) || status != 200) return -1;
+        return contentType.find("multipart/") != std::string::npos ? 2 : 1;
     }
 
     std::string host_;
@@ -380,6 +505,7 @@ private:
     std::string reso_;
     std::shared_ptr<CameraEntry> entry_;
     Clock::time_point deadline_;
+    Diagnosis problem_;  // why the call in progress fails
 };
 
 }  // namespace
@@ -388,6 +514,8 @@ CameraAPI* NewOnvifCamera(const std::string& host, int port, const std::string& 
                           const std::string& password, const std::string& channel) {
     return new OnvifCamera(host, port, username, password, channel);
 }
+
+Diagnosis LastDiagnosis() { return tLastDiagnosis; }
 
 void SetCallTimeoutMs(int ms) { gCallTimeoutMs = ms > 0 ? ms : 1; }
 int CallTimeoutMs() { return gCallTimeoutMs.load(); }

@@ -20,7 +20,10 @@
 // order the sources first appear in GetProfiles; empty, 0 or not a number
 // means the first. SetReso("WxH") picks that channel's profile whose encoder
 // resolution is WxH (else its first profile) for GetSnapshotPath, which gives
-// the snapshot URI's path with query, the port to use and type 1. Presets
+// the snapshot URI's path with query, the port to use and the fetch type: 2
+// when the URI serves a multipart stream (some cameras give their MJPEG stream
+// as the snapshot URI), else 1; the driver learns it once per profile from the
+// Content-Type of one GET that it ends at the first body byte. Presets
 // belong to the PTZ unit: GetPresetList and GoPreset use the channel's first
 // profile that has a PTZ configuration, whatever SetReso picked.
 // Preset positions: see onvif_soap.h (decimal tokens are their number, other
@@ -45,6 +48,21 @@
 #include "host/camera.h"
 
 namespace onvif {
+
+// Why the latest CameraAPI call of an ONVIF control object on this thread
+// failed, for messages and exit codes; kNone after a success.
+enum class Failure {
+    kNone,
+    kUnreachable,   // no answer: connection refused, timeout, no route, name unknown
+    kUnauthorized,  // the camera refused the credentials (HTTP 401/403, SOAP NotAuthorized)
+    kRefused,       // it answered, but refused the request or did not answer as ONVIF
+    kNoSuchPreset,  // GoPreset: the camera's own preset list lacks the position
+};
+struct Diagnosis {
+    Failure failure = Failure::kNone;
+    std::string detail;  // one line: the request and the camera's answer or curl's error
+};
+Diagnosis LastDiagnosis();
 
 CameraAPI* NewOnvifCamera(const std::string& host, int port, const std::string& username,
                           const std::string& password, const std::string& channel);

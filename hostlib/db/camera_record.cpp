@@ -7,6 +7,7 @@
 
 #include "host/camera.h"
 #include "host/database.h"
+#include "hostlib/camera/user_defined.h"
 #include "hostlib/db/camera_status.h"
 
 namespace {
@@ -29,8 +30,10 @@ std::string Text(DBResult_tag* result, const char* column) {
 }  // namespace
 
 int Camera::Load(int id, int /*option*/) {
-    const std::string sql = "SELECT id, host, port, username, password, vendor, model, channel, "
-                            "path, liveReso FROM camera WHERE id = " + itos(id) + ";";
+    const std::string sql =
+        "SELECT id, host, port, username, password, vendor, model, channel, "
+        "path, liveReso, snapshotType FROM camera WHERE id = " +
+        itos(id) + ";";
     DBResult_tag* result = nullptr;
     if (OvDBExecute(sql, &result) != 0) return -1;
     if (KELODBNumRows(result) != 1) {
@@ -48,8 +51,10 @@ int Camera::Load(int id, int /*option*/) {
     s.channel = Text(result, "channel");
     s.path = Text(result, "path");
     s.liveReso = Text(result, "liveReso");
+    s.snapshotType = static_cast<int>(strtol(Text(result, "snapshotType").c_str(), nullptr, 10));
     KELODBFreeResult(result);
     settings_ = s;
+    HostNoteSnapshotType(s.host, s.port, s.path, s.snapshotType);
     return 0;
 }
 

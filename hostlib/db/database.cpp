@@ -1,5 +1,7 @@
 // PostgreSQL database layer on libpq: a pool of connections, statements run
 // with PQexec, results kept as PGresult until the caller frees them.
+#include "host/database.h"
+
 #include <errno.h>
 #include <libpq-fe.h>
 #include <poll.h>
@@ -13,7 +15,6 @@
 #include <string>
 #include <vector>
 
-#include "host/database.h"
 #include "hostlib/db/database_config.h"
 
 const char* gszTablePatrol = "patrol";
@@ -31,6 +32,10 @@ using Clock = std::chrono::steady_clock;
 // How long one statement (or batch) may take, from the wait for a connection
 // to its last result. A stalled server must not hold a host thread forever.
 std::atomic<int> statementTimeoutMs{15000};
+
+Clock::time_point StatementDeadline() {
+    return Clock::now() + std::chrono::milliseconds(statementTimeoutMs.load());
+}
 
 struct ConnCloser {
     void operator()(PGconn* c) const { PQfinish(c); }
@@ -85,6 +90,7 @@ public:
             conn.reset();
         }
         if (!conn) conn = Connect(conninfo, deadline);
+        if (conn && PQstatus(conn.get()) != CONNECTION_OK) conn.reset();
         if (!conn) {
             Release(nullptr, generation);
             return nullptr;
@@ -132,21 +138,28 @@ public:
         return generation_;
     }
 
-private:
-    // Opens a connection by the deadline; null when that fails.
+    std::string ConnInfo() {
+        std::lock_guard<std::mutex> lock(mu_);
+        return conninfo_;
+    }
+
+    // Opens a connection by the deadline. Null only when out of memory; a
+    // connection that failed or was not up by the deadline says why in
+    // PQerrorMessage, and its status is not CONNECTION_OK.
     static ConnPtr Connect(const std::string& conninfo, Clock::time_point deadline) {
         const char* keys[] = {"dbname", "client_encoding", nullptr};
         const char* values[] = {conninfo.c_str(), "UTF8", nullptr};
         ConnPtr conn(PQconnectStartParams(keys, values, 1));
-        if (!conn || PQstatus(conn.get()) == CONNECTION_BAD ||
-            !FinishConnect(conn.get(), PQconnectPoll, deadline)) {
-            return nullptr;
+        if (!conn) return nullptr;
+        if (PQstatus(conn.get()) == CONNECTION_BAD || !FinishConnect(conn.get(), PQconnectPoll, deadline)) {
+            return conn;
         }
         // Server notices are not the host's business; libpq would print them to stderr.
         PQsetNoticeProcessor(conn.get(), [](void*, const char*) {}, nullptr);
         return conn;
     }
 
+private:
     // An idle connection has nothing to read unless its server sent a
     // termination notice or closed it (restart, shutdown, idle kill): then it
     // is reset before a statement is sent on it.
@@ -228,7 +241,7 @@ PGresult* ExecBounded(PGconn* conn, const std::string& sql, Clock::time_point de
 // Runs one statement, or several as one transaction; the result on success,
 // null on failure.
 PGresult* Run(const std::string& sql) {
-    const Clock::time_point deadline = Clock::now() + std::chrono::milliseconds(statementTimeoutMs.load());
+    const Clock::time_point deadline = StatementDeadline();
     Lease lease(deadline);
     if (!lease.get()) return nullptr;
     PGresult* res = ExecBounded(lease.get(), sql, deadline);
@@ -242,6 +255,38 @@ PGresult* Run(const std::string& sql) {
 }  // namespace
 
 void HostDBSetConnInfo(const std::string& conninfo) { ThePool().SetConnInfo(conninfo); }
+
+int HostDBCheck(std::string* where, std::string* error) {
+    {
+        Lease lease(StatementDeadline());
+        if (lease.get()) return 0;
+    }
+    // The pool gives no reason: one more attempt, kept to read it.
+    ConnPtr conn = Pool::Connect(ThePool().ConnInfo(), StatementDeadline());
+    if (conn && PQstatus(conn.get()) == CONNECTION_OK) return 0;
+    std::string tried, message = conn ? PQerrorMessage(conn.get()) : "out of memory";
+    if (message.empty()) message = "no answer within the statement timeout";
+    if (conn) {
+        const std::string host = PQhost(conn.get()) ? PQhost(conn.get()) : "";
+        const std::string port = PQport(conn.get()) ? PQport(conn.get()) : "";
+        tried =
+            host.empty() || host[0] == '/'
+                ? "socket " + (host.empty() ? std::string("(default)") : host) + "/.s.PGSQL." + port
+                : "host " + host + " port " + port;
+        tried += std::string(", database ") + (PQdb(conn.get()) ? PQdb(conn.get()) : "") +
+                 ", user " + (PQuser(conn.get()) ? PQuser(conn.get()) : "");
+    }
+    // One line: libpq's message may carry a hint on a second line.
+    std::string line;
+    for (char c : message) {
+        if (c == '\n' || c == '\t' || c == '\r') c = ' ';
+        if (!(c == ' ' && (line.empty() || line.back() == ' '))) line += c;
+    }
+    while (!line.empty() && line.back() == ' ') line.pop_back();
+    if (where) *where = tried;
+    if (error) *error = line;
+    return -1;
+}
 void HostDBSetPoolSize(int size) { ThePool().SetSize(size); }
 void HostDBSetStatementTimeoutMs(int ms) { statementTimeoutMs = ms > 0 ? ms : 1; }
 void HostDBCloseIdle() { ThePool().CloseIdle(); }
@@ -273,7 +318,7 @@ std::string OvDBEscapeString(const std::string& text) {
     std::string out(text.size() * 2 + 1, '\0');
     size_t n;
     {
-        Lease lease(Clock::now() + std::chrono::milliseconds(statementTimeoutMs.load()));
+        Lease lease(StatementDeadline());
         if (lease.get()) {
             int error = 0;
             n = PQescapeStringConn(lease.get(), &out[0], text.data(), text.size(), &error);

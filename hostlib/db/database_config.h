@@ -40,4 +40,12 @@ void HostDBSetStatementTimeoutMs(int ms);
 // Closes every idle connection (connections in use close when returned).
 void HostDBCloseIdle();
 
+// Whether the database can be reached with the settings in force: takes a
+// connection of the pool (opening one if none is idle) and gives it back, so
+// the check also warms the pool. 0: connected. -1: `where` names what was
+// tried, as "socket /run/postgresql/.s.PGSQL.5432" or "host db port 5432",
+// followed by ", database D, user U"; `error` holds libpq's message on one
+// line. Either pointer may be null.
+int HostDBCheck(std::string* where, std::string* error);
+
 #endif  // HOSTLIB_DATABASE_CONFIG_H

@@ -1,6 +1,8 @@
 -- Tables of the patrol store and the camera records the host layer reads.
 -- Unquoted names fold to lower case (camId is stored as camid); the library's
 -- statements spell them in camel case and reach the same columns.
+-- Safe to run again: it creates only what is missing.
+SET client_min_messages = warning;
 
 CREATE TABLE IF NOT EXISTS patrol (
     id        serial  PRIMARY KEY,
@@ -30,5 +32,8 @@ CREATE TABLE IF NOT EXISTS camera (
     model     text    NOT NULL DEFAULT '',
     channel   text    NOT NULL DEFAULT '',
     path      text    NOT NULL DEFAULT '',
-    liveReso  text    NOT NULL DEFAULT ''
+    liveReso  text    NOT NULL DEFAULT '',
+    snapshotType integer NOT NULL DEFAULT 1  -- user-defined cameras: 1 image, 2 MJPEG stream at path
 );
+-- Tables made before the column existed.
+ALTER TABLE camera ADD COLUMN IF NOT EXISTS snapshotType integer NOT NULL DEFAULT 1;

@@ -72,6 +72,13 @@ TEST_F(OnvifDriver, PresetsMovesSnapshotPathsAndChannels) {
     EXPECT_EQ(SnapshotPath(*Onvif(sim.Port(), "secret", "2")),
               "/snapshot.jpg?profile=Profile_2_main");
     EXPECT_EQ(SnapshotPath(*Onvif(sim.Port(), "secret", "3")), "failed");
+    // A snapshot URI that serves a multipart stream is fetched as type 2.
+    sim.SetFault("snapshot_stream", "1");
+    onvif::ForgetCameras();
+    std::string path;
+    int port = 80, type = 0;
+    ASSERT_EQ(Onvif(sim.Port())->GetSnapshotPath(path, port, type), 0);
+    EXPECT_EQ(path + " " + std::to_string(type), "/mjpeg?profile=Profile_1_main&frames=20 2");
     EXPECT_EQ(Onvif(sim.Port(), "secret", "2")->GoPreset(2, "kelo2"), 0);
     EXPECT_EQ(Moved(sim), (Tokens{"5", "9", "2"}));
 }
@@ -91,6 +98,7 @@ TEST_F(OnvifDriver, TextTokensMapToStablePositionsAndBack) {
     long before = SimRequests(sim.Port());
     EXPECT_EQ(Onvif(sim.Port())->GoPreset(onvif::PresetPosition("Preset_2"), "kelo"), -1);
     EXPECT_EQ(SimRequests(sim.Port()) - before, 1);
+    EXPECT_EQ(onvif::LastDiagnosis().failure, onvif::Failure::kNoSuchPreset);
     EXPECT_EQ(Moved(sim), (Tokens{"01", "Preset_1"}));
 }
 
@@ -112,12 +120,15 @@ TEST_F(OnvifDriver, Authentication) {
     Presets presets;
     auto start = std::chrono::steady_clock::now();
     EXPECT_EQ(Onvif(sim.Port(), "wrong")->GetPresetList(presets), -1);
+    EXPECT_EQ(onvif::LastDiagnosis().failure, onvif::Failure::kUnauthorized);
     EXPECT_EQ(Onvif(sim.Port(), "wrong")->GoPreset(1, "kelo1"), -1);
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
     // A camera that wants HTTP Digest and ignores WS-Security.
     sim.SetFault("http_auth_only", "1");
     EXPECT_EQ(Onvif(sim.Port())->GoPreset(1, "kelo1"), 0);
+    EXPECT_EQ(onvif::LastDiagnosis().failure, onvif::Failure::kNone);
     EXPECT_EQ(Onvif(sim.Port(), "wrong")->GoPreset(2, "kelo2"), -1);  // 401 after credentials
+    EXPECT_EQ(onvif::LastDiagnosis().failure, onvif::Failure::kUnauthorized);
     EXPECT_EQ(Moved(sim), Tokens{"1"});
 }
 
@@ -152,6 +163,8 @@ TEST_F(OnvifDriver, FaultsAndBrokenRepliesAreFailuresNeverEmptyLists) {
              {{"drop_mid_body", "1"}}}) {
         for (const auto& f : faults) sim.SetFault(f.first, f.second);
         EXPECT_EQ(Onvif(sim.Port())->GoPreset(2, "kelo2"), -1) << faults[0].first;
+        // The camera answered: refused, never taken for a wrong password or silence.
+        EXPECT_EQ(onvif::LastDiagnosis().failure, onvif::Failure::kRefused) << faults[0].first;
         Presets presets;  // GetPresets is not refused
         EXPECT_EQ(Onvif(sim.Port())->GetPresetList(presets), faults[0].first == "refuse" ? 0 : -1)
             << faults[0].first;
@@ -179,6 +192,7 @@ TEST_F(OnvifDriver, SlowOrStoppedCameraFailsWithinTheTimeout) {
     stopped.reset();
     Presets presets;
     EXPECT_TRUE(failsInTime([&] { return Onvif(port)->GetPresetList(presets) == -1; }));
+    EXPECT_EQ(onvif::LastDiagnosis().failure, onvif::Failure::kUnreachable);
     EXPECT_TRUE(failsInTime([&] { return SnapshotPath(*Onvif(port)) == "failed"; }));
 }
 

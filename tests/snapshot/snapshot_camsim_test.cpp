@@ -9,6 +9,7 @@
 
 #include "camsim.h"
 #include "host/http.h"
+#include "hostlib/camera/onvif_camera.h"
 #include "static_api.h"
 
 namespace {
@@ -71,6 +72,12 @@ TEST(SnapshotCamSim, DeliveriesGiveTheSameImageAndFaultsFail) {
     Camera camera;
     const int id = 800000000 + getpid() % 100000;
     camera.SetSettings({id, "127.0.0.1", sim.Port(), "admin", "secret", "onvif", "", "1", "", "1920x1080"});
+    ASSERT_EQ(SnapshotFileGet(&camera), 0);
+    EXPECT_TRUE(FileContent("/tmp/ov_snapshot_id_" + std::to_string(id) + ".jpg") == reference);
+    // A camera whose snapshot URI is its MJPEG stream: the driver says type 2
+    // and the file holds the stream's first frame.
+    sim.SetFault("snapshot_stream", "1");
+    onvif::ForgetCameras();
     ASSERT_EQ(SnapshotFileGet(&camera), 0);
     EXPECT_TRUE(FileContent("/tmp/ov_snapshot_id_" + std::to_string(id) + ".jpg") == reference);
     EXPECT_EQ(SnapshotFileDelete(id), 0);

@@ -162,7 +162,9 @@ std::vector<CamSim::Move> CamSim::Moves() {
     while (std::getline(in, line)) {
         size_t tab = line.find('\t');
         if (tab == std::string::npos) continue;
-        moves.push_back({line.substr(0, tab), strtod(line.c_str() + tab + 1, nullptr)});
+        char* end = nullptr;
+        const double seconds = strtod(line.c_str() + tab + 1, &end);
+        moves.push_back({line.substr(0, tab), seconds, strtod(end, nullptr)});
     }
     return moves;
 }

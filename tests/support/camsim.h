@@ -49,6 +49,7 @@ public:
     struct Move {
         std::string token;
         double seconds;
+        double monotonic;  // the same moment on CLOCK_MONOTONIC, in seconds
     };
     std::vector<Move> Moves();
     void ClearMoves();
@@ -73,6 +74,7 @@ public:
     //   "internal_address"="host:port"  reported in service and snapshot addresses
     //   "trickle_ms"=N       the image (MJPEG: frame "trickle_frame", default 0) declares
     //                        a Content-Length of 100000, then sends one byte every N ms
+    //   "snapshot_stream"="1" GetSnapshotUri gives the MJPEG stream (20 frames)
     void SetFault(const std::string& name, const std::string& value);
     void ClearFaults();
 

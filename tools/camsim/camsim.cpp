@@ -1,7 +1,7 @@
 // camsim: a PTZ network camera on 127.0.0.1 for tests and checks.
 //
 //   camsim [--port N] [--user U] [--password P] [--preset TOKEN=NAME]...
-//          [--exit-on-stdin-eof]
+//          [--snapshot-stream] [--exit-on-stdin-eof]
 //
 // Prints "CAMSIM_PORT=<port>" on stdout once it listens (port 0, the default,
 // picks a free one). Without --preset it has presets 1 Home, 2 Door, 5 Gate,
@@ -11,6 +11,7 @@
 //   GET  /mjpeg?profile=P&frames=N multipart/x-mixed-replace, 10 frames a second
 // and, without auth, the control endpoints for tests:
 //   GET  /control/ping | presets | moves | now | current | requests (count, control aside)
+//        (moves: "token<TAB>seconds since start<TAB>CLOCK_MONOTONIC seconds" lines)
 //   POST /control/presets (lines "token<TAB>name"), /control/moves/clear,
 //        /control/fault ("name=value"; empty value clears), /control/faults/clear
 // Faults: delay_ms, status, refuse, snapshot_delivery (length|chunked|close),
@@ -22,7 +23,9 @@
 // (/onvif/Media, /onvif/PTZ), internal_address ("host:port" reported in
 // service and snapshot addresses, as a camera behind NAT does), trickle_ms
 // (the image, or stream frame trickle_frame (default 0), declares a
-// Content-Length of 100000 and then sends one byte every trickle_ms ms).
+// Content-Length of 100000 and then sends one byte every trickle_ms ms),
+// snapshot_stream (GetSnapshotUri gives the MJPEG stream, 20 frames; set from
+// the start by --snapshot-stream).
 // GotoPreset carries only a token; every one received is logged on stderr
 // (unless the environment has CAMSIM_QUIET).
 #include "camsim.h"
@@ -296,9 +299,13 @@ void Serve(State& state, httplib::Server& svr) {
     svr.Get("/control/moves", [&state](const httplib::Request&, httplib::Response& res) {
         std::string out;
         std::lock_guard<std::mutex> lock(state.mu);
+        // token, seconds since start, and the same moment on the system's
+        // monotonic clock (to compare with other processes' times)
+        const double origin =
+            std::chrono::duration<double>(state.start.time_since_epoch()).count();
         for (const Move& m : state.moves) {
-            char t[40];
-            snprintf(t, sizeof t, "%.6f", m.seconds);
+            char t[80];
+            snprintf(t, sizeof t, "%.6f\t%.6f", m.seconds, origin + m.seconds);
             out += m.token + "\t" + t + "\n";
         }
         res.set_content(out, "text/plain");
@@ -345,7 +352,7 @@ void Serve(State& state, httplib::Server& svr) {
 void Usage() {
     fprintf(stderr,
             "usage: camsim [--port N] [--user U] [--password P] [--preset TOKEN=NAME]... "
-            "[--exit-on-stdin-eof]\n");
+            "[--snapshot-stream] [--exit-on-stdin-eof]\n");
     exit(2);
 }
 
@@ -375,6 +382,8 @@ int main(int argc, char** argv) {
             state.presets.push_back(
                 {p.substr(0, eq), eq == std::string::npos ? std::string() : p.substr(eq + 1)});
             presetsGiven = true;
+        } else if (a == "--snapshot-stream") {
+            state.faults["snapshot_stream"] = "1";
         } else if (a == "--exit-on-stdin-eof") {
             exitOnEof = true;
         } else {

@@ -360,8 +360,11 @@ std::string MediaUri(const std::string& uri) {
 SoapReply GetSnapshotUri(State& state, pugi::xml_node request) {
     const Profile* p = FindProfile(ChildText(request, "ProfileToken"));
     if (!p) return Fault(state, 400, "env:Sender", "ter:InvalidArgVal", "No such profile");
-    return Envelope("<trt:GetSnapshotUriResponse>" +
-                    MediaUri(BaseAddress(state) + "/snapshot.jpg?profile=" + p->token) +
+    // A camera whose snapshot URI is its MJPEG stream (a short one).
+    const std::string uri = state.Fault("snapshot_stream") == "1"
+                                ? "/mjpeg?profile=" + std::string(p->token) + "&frames=20"
+                                : "/snapshot.jpg?profile=" + std::string(p->token);
+    return Envelope("<trt:GetSnapshotUriResponse>" + MediaUri(BaseAddress(state) + uri) +
                     "</trt:GetSnapshotUriResponse>");
 }
 

@@ -1,0 +1,61 @@
+// ptzpatrol: the subcommands. Each returns an exit code or throws Error.
+#ifndef TOOLS_PTZPATROL_COMMANDS_H
+#define TOOLS_PTZPATROL_COMMANDS_H
+
+#include <string>
+#include <vector>
+
+#include "tool.h"
+
+namespace ptztool {
+
+struct CameraAddOptions {
+    int id = 0;  // 0: the next free id
+    std::string host;
+    int port = 80;
+    std::string user, passwordFile;
+    std::string vendor = "onvif";
+    std::string channel, path, reso;
+    std::string fetch = "image";  // userdefined: "image" or "stream"
+};
+
+int InitDb();
+int CameraAdd(const CameraAddOptions& options);
+int CameraList();
+int CameraRemove(int camId);
+int Presets(int camId);
+int PatrolCreate(int camId, const std::string& name, int stay,
+                 const std::vector<std::string>& presets);
+int PatrolList(int camId);
+int PatrolShow(int id);
+int PatrolDelete(int id);
+int Snapshot(int camId, const std::string& file);
+
+struct RunOptions {
+    std::string snapshotDir;  // a snapshot after each move, when set
+};
+int Run(int patrolId, const RunOptions& options);
+
+struct GuardOptions {
+    std::string mode = "continuous";
+    int repeat = 1;
+    int pauseMinutes = 1;
+    int eventValidSeconds = 10;
+    std::string snapshotDir;
+};
+int Guard(int patrolId, const GuardOptions& options);
+
+// One snapshot: into `file`, or the camera's /tmp file when `file` is empty.
+struct SnapshotTaken {
+    std::string file;
+    long bytes;
+    int type;  // 1 single image, 2 first part of a multipart stream
+    std::string url;
+};
+SnapshotTaken TakeSnapshot(const Camera& camera, const std::string& file);
+nlohmann::json SnapshotJson(const SnapshotTaken& snapshot);
+std::string SnapshotText(const SnapshotTaken& snapshot);
+
+}  // namespace ptztool
+
+#endif  // TOOLS_PTZPATROL_COMMANDS_H
