@@ -87,6 +87,9 @@ bool ReadTopic(pugi::xml_node topic, Notification& n) {
             if (!uri.empty() && uri != n.topicNs) n.topic += "{" + uri + "}";
         }
         n.topic += segment;
+        // Namespace URIs are as long as the camera likes: bound what they add.
+        if (n.topic.size() > kMaxTopicChars * 4 || n.topicNs.size() > kMaxTopicChars * 4)
+            return false;
         if (slash == text.size()) break;
     }
     return true;

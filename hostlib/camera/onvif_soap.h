@@ -163,7 +163,7 @@ private:
 // ---- event messages ----
 
 constexpr size_t kMaxNotifications = 64;     // kept of one pull
-constexpr size_t kMaxTopicChars = 256;       // longer topics: the message is dropped
+constexpr size_t kMaxTopicChars = 256;       // longer topics (or 4x that resolved): dropped
 constexpr size_t kMaxItemChars = 128;        // names and values: longer ones are cut
 constexpr size_t kMaxItems = 8;              // source and data items kept, each
 constexpr size_t kMaxReferenceChars = 2048;  // reference parameters: longer ones are dropped
