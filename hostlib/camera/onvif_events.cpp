@@ -3,9 +3,13 @@
 #include "hostlib/camera/onvif_events.h"
 
 #include <curl/curl.h>
+#include <errno.h>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
 #include <sys/random.h>
 #include <sys/time.h>
 #include <time.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
@@ -72,14 +76,26 @@ struct EventHub::Impl {
     bool running = false;  // the thread takes requests
     uint64_t nextId = 1;
 
-    CURLM* multi = nullptr;  // curl_multi_wakeup is safe from any thread
+    // Set up by the constructor; used by the hub thread only (Wake by any).
+    CURLM* multi = nullptr;
+    int epoll = -1;  // curl's sockets and wake
+    int wake = -1;   // eventfd: requests are waiting
+    bool started = false;
     pthread_t thread;
     // Hub thread only.
     std::map<uint64_t, std::unique_ptr<Session>> sessions;
+    Steady::time_point curlTimer = Steady::time_point::max();  // when curl wants to run
 
-    void Wake() { curl_multi_wakeup(multi); }
+    void Wake() {
+        uint64_t one = 1;
+        if (write(wake, &one, sizeof one) < 0) {
+            // The counter is full: the thread is woken anyway.
+        }
+    }
     static void* Main(void* self);
     void Loop();
+    static int OnSocket(CURL*, curl_socket_t s, int what, void* self, void* known);
+    static int OnTimer(CURLM*, long ms, void* self);
 };
 
 namespace {
@@ -584,10 +600,54 @@ void* EventHub::Impl::Main(void* self) {
     return nullptr;
 }
 
+// curl's sockets are watched with epoll and driven one by one with
+// curl_multi_socket_action, so a wakeup costs the sockets that are ready,
+// not all of them (curl_multi_poll polls every socket of every camera).
+int EventHub::Impl::OnSocket(CURL*, curl_socket_t s, int what, void* self, void* known) {
+    Impl* hub = static_cast<Impl*>(self);
+    if (what == CURL_POLL_REMOVE) {
+        epoll_ctl(hub->epoll, EPOLL_CTL_DEL, s, nullptr);
+        curl_multi_assign(hub->multi, s, nullptr);
+        return 0;
+    }
+    struct epoll_event ev = {};
+    ev.events = (what & CURL_POLL_IN ? EPOLLIN : 0u) | (what & CURL_POLL_OUT ? EPOLLOUT : 0u);
+    ev.data.fd = s;
+    if (epoll_ctl(hub->epoll, known ? EPOLL_CTL_MOD : EPOLL_CTL_ADD, s, &ev) != 0 &&
+        errno == ENOENT)
+        epoll_ctl(hub->epoll, EPOLL_CTL_ADD, s, &ev);
+    curl_multi_assign(hub->multi, s, hub);  // known from now on
+    return 0;
+}
+
+int EventHub::Impl::OnTimer(CURLM*, long ms, void* self) {
+    static_cast<Impl*>(self)->curlTimer =
+        ms < 0 ? Steady::time_point::max() : Steady::now() + Ms(ms);
+    return 0;
+}
+
+
 void EventHub::Impl::Loop() {
     bool quitting = false;
     Steady::time_point quitDeadline;
+    struct epoll_event events[64];
+    int ready = 0;
     for (;;) {
+        int active = 0;
+        for (int i = 0; i < ready; ++i) {
+            if (events[i].data.fd == wake) {
+                uint64_t count;
+                if (read(wake, &count, sizeof count) < 0) {
+                    // Nothing to read: another wakeup took it.
+                }
+                continue;
+            }
+            int flags = (events[i].events & EPOLLIN ? CURL_CSELECT_IN : 0) |
+                        (events[i].events & EPOLLOUT ? CURL_CSELECT_OUT : 0) |
+                        (events[i].events & (EPOLLERR | EPOLLHUP) ? CURL_CSELECT_ERR : 0);
+            curl_multi_socket_action(multi, events[i].data.fd, flags, &active);
+        }
+
         std::vector<Add> newSessions;
         std::vector<uint64_t> newStops;
         bool quitNow;
@@ -618,14 +678,20 @@ void EventHub::Impl::Loop() {
             quitDeadline = Steady::now() + Ms(std::min(wait, 5000));
         }
 
-        int active = 0;
-        curl_multi_perform(multi, &active);
-        int left = 0;
-        while (CURLMsg* m = curl_multi_info_read(multi, &left)) {
-            if (m->msg != CURLMSG_DONE) continue;
-            Session* s = nullptr;
-            curl_easy_getinfo(m->easy_handle, CURLINFO_PRIVATE, reinterpret_cast<char**>(&s));
-            if (s) s->OnDone(m->data.result);
+        for (int round = 0; round < 2; ++round) {
+            // Curl's timers (the timeouts, and a new transfer's start); a
+            // session that starts a request below is run in the second round.
+            if (Steady::now() >= curlTimer) {
+                curlTimer = Steady::time_point::max();
+                curl_multi_socket_action(multi, CURL_SOCKET_TIMEOUT, 0, &active);
+            }
+            int left = 0;
+            while (CURLMsg* m = curl_multi_info_read(multi, &left)) {
+                if (m->msg != CURLMSG_DONE) continue;
+                Session* s = nullptr;
+                curl_easy_getinfo(m->easy_handle, CURLINFO_PRIVATE, reinterpret_cast<char**>(&s));
+                if (s) s->OnDone(m->data.result);
+            }
         }
         Steady::time_point now = Steady::now();
         Steady::time_point next = now + Ms(60000);
@@ -641,11 +707,12 @@ void EventHub::Impl::Loop() {
         }
         if (quitting && (sessions.empty() || now >= quitDeadline)) break;
         if (quitting) next = std::min(next, quitDeadline);
-        long curlMs = -1;
-        curl_multi_timeout(multi, &curlMs);
-        int64_t waitMs = std::max<int64_t>(0, MsUntil(next, Steady::now()) + 1);
-        if (curlMs >= 0) waitMs = std::min<int64_t>(waitMs, curlMs);
-        curl_multi_poll(multi, nullptr, 0, static_cast<int>(waitMs), nullptr);
+        next = std::min(next, curlTimer);
+        int64_t waitMs = std::max<int64_t>(0, MsUntil(next, Steady::now()));
+        // Round up, so a timer is not woken for just before it is due.
+        if (next > Steady::now() && Steady::now() + Ms(waitMs) < next) ++waitMs;
+        ready = epoll_wait(epoll, events, 64, static_cast<int>(std::min<int64_t>(waitMs, 60000)));
+        if (ready < 0) ready = 0;
     }
     sessions.clear();
     std::lock_guard<std::mutex> lock(mu);
@@ -655,26 +722,48 @@ void EventHub::Impl::Loop() {
 
 EventHub::EventHub() : impl_(std::make_shared<Impl>()) {
     HostCurlGlobalInit();
-    impl_->multi = curl_multi_init();
-    if (!impl_->multi) return;
-    impl_->running = true;
-    if (StartWorkerThread(&impl_->thread, &Impl::Main, impl_.get()) != 0) {
-        impl_->running = false;
-        curl_multi_cleanup(impl_->multi);
-        impl_->multi = nullptr;
+    Impl& h = *impl_;
+    h.multi = curl_multi_init();
+    h.epoll = epoll_create1(EPOLL_CLOEXEC);
+    h.wake = eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
+    struct epoll_event ev = {};
+    ev.events = EPOLLIN;
+    ev.data.fd = h.wake;
+    if (h.multi && h.epoll >= 0 && h.wake >= 0 &&
+        epoll_ctl(h.epoll, EPOLL_CTL_ADD, h.wake, &ev) == 0) {
+        curl_multi_setopt(h.multi, CURLMOPT_SOCKETFUNCTION, &Impl::OnSocket);
+        curl_multi_setopt(h.multi, CURLMOPT_SOCKETDATA, &h);
+        curl_multi_setopt(h.multi, CURLMOPT_TIMERFUNCTION, &Impl::OnTimer);
+        curl_multi_setopt(h.multi, CURLMOPT_TIMERDATA, &h);
+        h.running = true;
+        h.started = StartWorkerThread(&h.thread, &Impl::Main, &h) == 0;
+        if (h.started) return;
+        h.running = false;
     }
+    Close();
+}
+
+void EventHub::Close() {
+    Impl& h = *impl_;
+    if (h.multi) curl_multi_cleanup(h.multi);
+    if (h.epoll >= 0) close(h.epoll);
+    if (h.wake >= 0) close(h.wake);
+    h.multi = nullptr;
+    h.epoll = h.wake = -1;
 }
 
 EventHub::~EventHub() {
-    if (!impl_->multi) return;
+    if (!impl_->started) {
+        Close();
+        return;
+    }
     {
         std::lock_guard<std::mutex> lock(impl_->mu);
         impl_->quit = true;
     }
     impl_->Wake();
     pthread_join(impl_->thread, nullptr);
-    curl_multi_cleanup(impl_->multi);
-    impl_->multi = nullptr;
+    Close();
 }
 
 // ---- source ----

@@ -169,6 +169,7 @@ public:
 
 private:
     friend class EventSource;
+    void Close();
     std::shared_ptr<Impl> impl_;
 };
 
