@@ -28,11 +28,14 @@
 // answers, whether it is subscribed and the last error.
 //
 // Threads: one hub thread drives all subscriptions of a process with
-// libcurl's multi interface (no thread nor stack per camera; idle cameras
-// cost nothing between replies). It calls no user code and holds a source's
-// mutex only to store what a reply said. Stop aborts the camera's transfer
-// at once (the hub is woken, no long poll is waited out); the Unsubscribe
-// then runs in the hub, bounded by stopTimeoutMs.
+// libcurl's multi interface, its sockets watched with epoll, so there is no
+// thread nor stack per camera (hundreds of threads would reserve hundreds of
+// MiB of a 32-bit host's address space), a wakeup costs only the sockets
+// that are ready, and one reply is parsed at a time (transient memory does
+// not grow with the number of cameras). The hub calls no user code and holds
+// a source's mutex only to store what a reply said. Stop wakes the hub, which
+// aborts the camera's transfer at once (no long poll is waited out); the
+// Unsubscribe then runs in the hub, bounded by stopTimeoutMs.
 //
 // The dialogue with the camera, each request bounded in time:
 //   1. GetSystemDateAndTime (unsigned, then signed if refused): the clock
