@@ -109,6 +109,8 @@ public:
         o_.pullSeconds = std::max(o_.pullSeconds, 1);
         o_.retryMinMs = std::max(o_.retryMinMs, 1);
         o_.retryMaxMs = std::max(o_.retryMaxMs, o_.retryMinMs);
+        o_.callTimeoutMs = std::max(o_.callTimeoutMs, 100);
+        o_.stopTimeoutMs = std::max(o_.stopTimeoutMs, 1);
         wakeAt_ = Steady::now();  // the first timer begins the dialogue
     }
 
@@ -416,6 +418,10 @@ private:
     // The dialogue failed: after a backoff it starts again from step 1. A
     // camera that does not answer has no events meanwhile.
     void Fail(Outcome outcome, const std::string& error) {
+        if (stopping_) {  // the final Unsubscribe could not be sent
+            finished_ = true;
+            return;
+        }
         SetError(error);
         if (sub_.live) old_ = sub_;
         sub_.live = false;

@@ -185,7 +185,8 @@ public:
     EventSource& operator=(const EventSource&) = delete;
 
     // Returns once the hub has dropped the camera's transfer in progress; the
-    // events read as absent from then on. Idempotent.
+    // events read as absent from then on. Idempotent; not to be called by two
+    // threads at once.
     void Stop();
     void Read(EVENT_STATUS* first, EVENT_STATUS* second) const;
     EventSourceStatus Status() const;
