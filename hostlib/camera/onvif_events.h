@@ -18,7 +18,8 @@
 //     subscription was lost while it was true. So an event is present for
 //     the guard while it is true and for the validity window after it ended,
 //     and a short pulse (true then false within one pull, or between two
-//     reads) is never lost;
+//     reads) is never lost. A Changed to false is a fall even when its rise
+//     came before the subscription;
 //   - active 0, timestamp 0: not true since the camera was (re)subscribed as
 //     far as we know (an Initialized false is not a fall), the property was
 //     Deleted, the camera does not answer, or the source is stopped;
@@ -58,7 +59,9 @@
 // subscription) means subscribe again from step 3, at once the first time;
 // a camera that does not answer means from step 1 after a backoff, and its
 // events read as absent meanwhile. Backoff: retryMinMs, doubling to
-// retryMaxMs; reset by a successful pull.
+// retryMaxMs; reset by a successful pull. A camera that closes its
+// connections is noticed at once; one that vanishes silently (powered off,
+// cable pulled) when its pull's HTTP timeout runs out (pullSeconds + 5 s).
 //
 // Bounds: replies over 128 KiB fail; at most kMaxNotifications messages of a
 // pull, kMaxSources sources per event and the item and topic lengths of
