@@ -344,6 +344,11 @@ void Usage() {
 }  // namespace
 }  // namespace camsim
 
+// In a ThreadSanitizer build the simulator would sleep a second at exit (the
+// sanitizer's default, to catch races at exit), and every test that stops one
+// would wait for it.
+extern "C" const char* __tsan_default_options() { return "atexit_sleep_ms=0"; }
+
 int main(int argc, char** argv) {
     camsim::State state;
     int port = 0;
