@@ -13,6 +13,8 @@
 #include <utility>
 #include <vector>
 
+#include "hostlib/camera/onvif_xml.h"
+
 namespace onvif {
 
 const char* const kNsSoap = "http://www.w3.org/2003/05/soap-envelope";
@@ -20,6 +22,9 @@ const char* const kNsSchema = "http://www.onvif.org/ver10/schema";
 const char* const kNsDevice = "http://www.onvif.org/ver10/device/wsdl";
 const char* const kNsMedia = "http://www.onvif.org/ver10/media/wsdl";
 const char* const kNsPtz = "http://www.onvif.org/ver20/ptz/wsdl";
+const char* const kNsEvents = "http://www.onvif.org/ver10/events/wsdl";
+const char* const kNsWsnt = "http://docs.oasis-open.org/wsn/b-2";
+const char* const kNsTopics = "http://www.onvif.org/ver10/topics";
 
 namespace {
 
@@ -29,112 +34,9 @@ const char* const kNsWsse =
 const char* const kNsWsu =
     "http://docs.oasis-open.org/wss/2004/01/oasis-200401-wss-wssecurity-utility-1.0.xsd";
 
-std::string Escape(const std::string& s) {
-    std::string out;
-    for (char c : s) {
-        switch (c) {
-            case '&':
-                out += "&amp;";
-                break;
-            case '<':
-                out += "&lt;";
-                break;
-            case '>':
-                out += "&gt;";
-                break;
-            case '"':
-                out += "&quot;";
-                break;
-            case '\'':
-                out += "&apos;";
-                break;
-            default:
-                out += c;
-        }
-    }
-    return out;
-}
-
-const char* LocalName(const char* name) {
-    const char* colon = strchr(name, ':');
-    return colon ? colon + 1 : name;
-}
-
-// The namespace declarations of a document, gathered in one walk, so that
-// resolving an element's prefix costs one lookup per ancestor instead of a
-// scan of each ancestor's attributes: a reply with thousands of attributes
-// and thousands of matching elements would otherwise take minutes to read.
-// Names and values point into the document, which must outlive the index.
-class Namespaces {
-public:
-    void Index(const pugi::xml_document& doc) {
-        declared_.clear();
-        for (pugi::xml_node n = doc.first_child(); n;) {
-            if (n.type() == pugi::node_element)
-                for (pugi::xml_attribute a = n.first_attribute(); a; a = a.next_attribute()) {
-                    const char* name = a.name();
-                    if (strncmp(name, "xmlns", 5) != 0 || (name[5] != '\0' && name[5] != ':'))
-                        continue;
-                    // The first declaration of a prefix on an element counts.
-                    declared_.emplace(Key{n.internal_object(), name[5] ? name + 6 : ""}, a.value());
-                }
-            // Depth first, without recursion.
-            if (n.first_child()) {
-                n = n.first_child();
-                continue;
-            }
-            while (n && !n.next_sibling()) n = n.parent();
-            if (n) n = n.next_sibling();
-        }
-    }
-
-    // The namespace URI of an element: its prefix resolved through the
-    // declarations of the element and its ancestors; "" when undeclared.
-    const char* Of(pugi::xml_node node) const {
-        const char* name = node.name();
-        const char* colon = strchr(name, ':');
-        std::string_view prefix = colon ? std::string_view(name, colon - name) : std::string_view();
-        for (pugi::xml_node n = node; n; n = n.parent()) {
-            if (n.type() != pugi::node_element) continue;
-            auto it = declared_.find(Key{n.internal_object(), prefix});
-            if (it != declared_.end()) return it->second;
-        }
-        return "";
-    }
-
-    bool Matches(pugi::xml_node node, const char* ns, const char* local) const {
-        return node.type() == pugi::node_element && strcmp(LocalName(node.name()), local) == 0 &&
-               strcmp(Of(node), ns) == 0;
-    }
-
-    pugi::xml_node Child(pugi::xml_node node, const char* ns, const char* local) const {
-        for (pugi::xml_node c = node.first_child(); c; c = c.next_sibling())
-            if (Matches(c, ns, local)) return c;
-        return {};
-    }
-
-    std::vector<pugi::xml_node> Children(pugi::xml_node node, const char* ns,
-                                         const char* local) const {
-        std::vector<pugi::xml_node> out;
-        for (pugi::xml_node c = node.first_child(); c; c = c.next_sibling())
-            if (Matches(c, ns, local)) out.push_back(c);
-        return out;
-    }
-
-private:
-    using Key = std::pair<const void*, std::string_view>;  // element, prefix ("" default)
-    std::map<Key, const char*> declared_;
-};
-
-std::string Trimmed(const char* text) {
-    std::string s = text;
-    size_t b = s.find_first_not_of(" \t\r\n");
-    if (b == std::string::npos) return "";
-    size_t e = s.find_last_not_of(" \t\r\n");
-    return s.substr(b, e - b + 1);
-}
-
-std::string Text(pugi::xml_node node) { return Trimmed(node.text().as_string()); }
+using xml::Escape;
+using xml::Namespaces;
+using xml::Text;
 
 std::string Request(const char* prefix, const char* ns, const char* name,
                     const std::string& inner = "") {
@@ -186,13 +88,15 @@ std::string FormatUtc(time_t t) {
     return buf;
 }
 
-std::string Envelope(const std::string& body, const UsernameToken* token) {
+std::string Envelope(const std::string& body, const UsernameToken* token,
+                     const std::string& header) {
     std::string out =
         std::string("<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<s:Envelope xmlns:s=\"") +
         kNsSoap + "\">";
+    if (token || !header.empty()) out += "<s:Header>" + header;
     if (token) {
-        out += std::string("<s:Header><wsse:Security s:mustUnderstand=\"1\" xmlns:wsse=\"") +
-               kNsWsse + "\" xmlns:wsu=\"" + kNsWsu + "\"><wsse:UsernameToken>" +
+        out += std::string("<wsse:Security s:mustUnderstand=\"1\" xmlns:wsse=\"") + kNsWsse +
+               "\" xmlns:wsu=\"" + kNsWsu + "\"><wsse:UsernameToken>" +
                Element("wsse", "Username", token->user) +
                "<wsse:Password Type=\"http://docs.oasis-open.org/wss/2004/01/"
                "oasis-200401-wss-username-token-profile-1.0#PasswordDigest\">" +
@@ -200,8 +104,9 @@ std::string Envelope(const std::string& body, const UsernameToken* token) {
                "</wsse:Password><wsse:Nonce EncodingType=\"http://docs.oasis-open.org/wss/2004/01/"
                "oasis-200401-wss-soap-message-security-1.0#Base64Binary\">" +
                Base64(token->nonce) + "</wsse:Nonce>" + Element("wsu", "Created", token->created) +
-               "</wsse:UsernameToken></wsse:Security></s:Header>";
+               "</wsse:UsernameToken></wsse:Security>";
     }
+    if (token || !header.empty()) out += "</s:Header>";
     out += "<s:Body>" + body + "</s:Body></s:Envelope>";
     return out;
 }
@@ -238,12 +143,6 @@ std::string ActionOf(const std::string& body) {
 }
 
 // ---- replies ----
-
-struct Reply::Impl {
-    pugi::xml_document doc;
-    Namespaces names;
-    pugi::xml_node body;  // first element of the Body
-};
 
 Reply::Reply() : impl_(new Impl) {}
 Reply::~Reply() { delete impl_; }
@@ -326,6 +225,7 @@ Reply::Addresses Reply::Services() const {
         std::string xaddr = Text(names.Child(s, kNsDevice, "XAddr"));
         if (ns == kNsMedia && a.media.empty()) a.media = xaddr;
         if (ns == kNsPtz && a.ptz.empty()) a.ptz = xaddr;
+        if (ns == kNsEvents && a.events.empty()) a.events = xaddr;
     }
     return a;
 }
@@ -337,6 +237,7 @@ Reply::Addresses Reply::Capabilities() const {
     pugi::xml_node caps = names.Child(impl_->body, kNsDevice, "Capabilities");
     a.media = Text(names.Child(names.Child(caps, kNsSchema, "Media"), kNsSchema, "XAddr"));
     a.ptz = Text(names.Child(names.Child(caps, kNsSchema, "PTZ"), kNsSchema, "XAddr"));
+    a.events = Text(names.Child(names.Child(caps, kNsSchema, "Events"), kNsSchema, "XAddr"));
     return a;
 }
 

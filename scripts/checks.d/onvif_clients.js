@@ -1,6 +1,7 @@
 // Third-party ONVIF clients against the camera simulator: each connects,
-// lists presets, moves to one and fetches the snapshot. Every call runs under
-// its own timeout. Then a wrong password must fail (or time out) without a move.
+// lists presets, moves to one and fetches the snapshot; one also receives a
+// motion event over PullPoint. Every call runs under its own timeout. Then a
+// wrong password must fail (or time out) without a move.
 //   node onvif_clients.js <port>
 'use strict';
 const http = require('http');
@@ -67,6 +68,43 @@ async function withOnvif(password) {
   const snap = await within('onvif snapshot', digestGet(uri.uri, 'admin', password));
   if (snap.res.statusCode !== 200 || !isJpeg(snap.body)) throw new Error('onvif: snapshot is not a JPEG');
   console.log(`onvif: ${tokens.length} presets, moved to 5, snapshot ${snap.body.length} bytes`);
+  await motionEvent(cam);
+}
+
+function post(path, body) {
+  return new Promise((resolve, reject) => {
+    const req = http.request({ host: '127.0.0.1', port, path, method: 'POST' }, (res) => {
+      res.resume();
+      res.on('end', () => resolve(res.statusCode));
+    });
+    req.on('error', reject);
+    req.end(body);
+  });
+}
+
+// The client's own PullPoint subscription sees the motion alarm raised on the camera.
+async function motionEvent(cam) {
+  const seen = new Promise((resolve) => {
+    cam.on('event', (m) => {
+      const topic = String(m.topic && m.topic._ !== undefined ? m.topic._ : m.topic);
+      const item = m.message && m.message.message && m.message.message.data &&
+                   m.message.message.data.simpleItem;
+      const value = item && item.$ ? item.$.Value : undefined;
+      if (topic.endsWith('VideoSource/MotionAlarm') && String(value) === 'true') resolve(topic);
+    });
+  });
+  // Raised once the client's subscription exists (polled, at most 10 s).
+  for (let i = 0; ; ++i) {
+    const live = await get(`http://127.0.0.1:${port}/control/subscriptions`);
+    if (Number(live.body.toString()) > 0) break;
+    if (i === 200) throw new Error('onvif: no event subscription made');
+    await new Promise((r) => setTimeout(r, 50));
+  }
+  await post('/control/event', 'motion=1');
+  const topic = await within('onvif motion event', seen);
+  cam.removeAllListeners('event');
+  await post('/control/event', 'motion=0');
+  console.log(`onvif: event ${topic} true`);
 }
 
 async function withNodeOnvif(password) {

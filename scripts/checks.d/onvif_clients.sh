@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Third-party ONVIF clients (npm packages onvif and node-onvif, pinned) check
-# the camera simulator: connect, list presets, move, fetch the snapshot, and
+# the camera simulator: connect, list presets, move, fetch the snapshot,
+# receive a motion event through the client's own PullPoint subscription, and
 # refuse a wrong password. The packages go to a temporary directory that is
 # removed afterwards, like the simulator this script starts.
 set -euo pipefail

@@ -69,6 +69,9 @@ CamSim::CamSim(Options options) {
     std::string binary = Binary();
     std::vector<std::string> args = {binary,       "--exit-on-stdin-eof", "--user",
                                      options.user, "--password",          options.password};
+    if (options.port > 0) args.insert(args.end(), {"--port", std::to_string(options.port)});
+    if (options.threads > 0)
+        args.insert(args.end(), {"--threads", std::to_string(options.threads)});
     std::vector<char*> argv;
     for (std::string& a : args) argv.push_back(&a[0]);
     argv.push_back(nullptr);
@@ -179,6 +182,31 @@ void CamSim::SetFault(const std::string& name, const std::string& value) {
 }
 
 void CamSim::ClearFaults() { Control("POST", "/control/faults/clear", ""); }
+
+void CamSim::SetEvents(const std::string& states) {
+    if (Control("POST", "/control/event", states) != "ok\n")
+        throw std::runtime_error("CamSim: setting events " + states + " failed");
+}
+
+CamSim::EventStats CamSim::Events() {
+    EventStats s;
+    std::istringstream in(Control("GET", "/control/events/stats", ""));
+    std::string word;
+    while (in >> word) {
+        size_t eq = word.find('=');
+        if (eq == std::string::npos) continue;
+        int v = atoi(word.c_str() + eq + 1);
+        std::string k = word.substr(0, eq);
+        if (k == "live") s.live = v;
+        if (k == "created") s.created = v;
+        if (k == "renewed") s.renewed = v;
+        if (k == "unsubscribed") s.unsubscribed = v;
+        if (k == "pulls") s.pulls = v;
+    }
+    return s;
+}
+
+void CamSim::DropSubscriptions() { Control("POST", "/control/events/drop", ""); }
 
 std::string CamSim::SnapshotPath() const { return "/snapshot.jpg?profile=Profile_1_main"; }
 

@@ -31,6 +31,8 @@ public:
         // token, name
         std::vector<std::pair<std::string, std::string>> presets = {
             {"1", "Home"}, {"2", "Door"}, {"5", "Gate"}, {"9", "Yard"}};
+        int port = 0;     // 0: a free one
+        int threads = 0;  // connections served at once; 0: the simulator's default (32)
     };
 
     CamSim();
@@ -71,12 +73,26 @@ public:
     //                        must be within 300 s of it)
     //   "no_get_services"="1", "no_get_capabilities"="1"  the action answers a fault
     //   "alt_paths"="1"      media and PTZ services at /onvif/Media and /onvif/PTZ
-    //   "internal_address"="host:port"  reported in service and snapshot addresses
+    //   "internal_address"="host:port"  reported in service, snapshot and event addresses
     //   "trickle_ms"=N       the image (MJPEG: frame "trickle_frame", default 0) declares
     //                        a Content-Length of 100000, then sends one byte every N ms
     //   "snapshot_stream"="1" GetSnapshotUri gives the MJPEG stream (20 frames)
+    //   events (tools/camsim/camsim_events.h): "event_slots"=N (default 4),
+    //   "event_grant_s"=N, "pull_fault"=N (the next N pulls), "event_soap11"="1",
+    //   "event_prefixes"="1", "event_cell_motion"="1", "event_ref_params"="1"
     void SetFault(const std::string& name, const std::string& value);
     void ClearFaults();
+
+    // Raises (1) or clears (0) the motion alarm and the digital input:
+    // "motion=1", "input=0", several joined by '&' (applied in order).
+    void SetEvents(const std::string& states);
+    // Event subscriptions: live now, and created, renewed, unsubscribed and
+    // pulled since the start.
+    struct EventStats {
+        int live = 0, created = 0, renewed = 0, unsubscribed = 0, pulls = 0;
+    };
+    EventStats Events();
+    void DropSubscriptions();  // the camera forgets them all, as after a reboot
 
     // Request paths (with query) of the JPEG and of the MJPEG stream (5 s, 10 frames a second).
     std::string SnapshotPath() const;

@@ -1,12 +1,15 @@
 // camsim: a PTZ network camera on 127.0.0.1 for tests and checks.
 //
 //   camsim [--port N] [--user U] [--password P] [--preset TOKEN=NAME]...
-//          [--snapshot-stream] [--exit-on-stdin-eof]
+//          [--snapshot-stream] [--threads N] [--exit-on-stdin-eof]
 //
 // Prints "CAMSIM_PORT=<port>" on stdout once it listens (port 0, the default,
 // picks a free one). Without --preset it has presets 1 Home, 2 Door, 5 Gate,
-// 9 Yard. Serves, with HTTP Digest auth (SOAP also takes WS-Security):
+// 9 Yard. --threads: connections served at once (default 32; each keep-alive
+// connection, and so each waiting event pull, holds one). Serves, with HTTP
+// Digest auth (SOAP also takes WS-Security):
 //   POST /onvif/device_service, /onvif/media_service, /onvif/ptz_service  ONVIF
+//   POST /onvif/event_service, /onvif/events/subscription/...  events (camsim_events.h)
 //   GET  /snapshot.jpg?profile=P   JPEG filled with the colour of the current preset
 //   GET  /mjpeg?profile=P&frames=N multipart/x-mixed-replace, 10 frames a second
 // and, without auth, the control endpoints for tests:
@@ -30,18 +33,23 @@
 // (unless the environment has CAMSIM_QUIET).
 #include "camsim.h"
 
+#include <arpa/inet.h>
 #include <httplib.h>
+#include <netinet/in.h>
 #include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
 #include <memory>
 #include <random>
 #include <sstream>
 #include <thread>
+
+#include "camsim_events.h"
 
 namespace camsim {
 
@@ -74,6 +82,8 @@ bool Trickle(httplib::DataSink& sink, size_t count, long ms) {
     }
     return true;
 }
+
+int gThreads = 32;
 
 bool IsControl(const std::string& path) { return path.rfind("/control/", 0) == 0; }
 
@@ -185,7 +195,7 @@ std::string CurrentToken(State& state) {
 }
 
 void Serve(State& state, httplib::Server& svr) {
-    svr.new_task_queue = [] { return new httplib::ThreadPool(32); };
+    svr.new_task_queue = [] { return new httplib::ThreadPool(gThreads); };
     // Headers and body go out in separate writes; without this, Nagle and the
     // client's delayed ACK add ~40 ms to every reply.
     svr.set_tcp_nodelay(true);
@@ -347,17 +357,40 @@ void Serve(State& state, httplib::Server& svr) {
         state.faults.clear();
         res.set_content("ok\n", "text/plain");
     });
+    ServeEventControls(state, svr);
+}
+
+// The server library listens with a backlog of 5: many clients connecting
+// at once (the event tests and benchmark) would see their SYNs dropped and
+// retried a second later. listen() again on the bound socket raises it.
+void RaiseBacklog(int port) {
+    for (int fd = 3; fd < 1024; ++fd) {
+        struct sockaddr_in a;
+        socklen_t len = sizeof a;
+        int listening = 0;
+        socklen_t optlen = sizeof listening;
+        if (getsockname(fd, reinterpret_cast<struct sockaddr*>(&a), &len) != 0 ||
+            a.sin_family != AF_INET || ntohs(a.sin_port) != port ||
+            getsockopt(fd, SOL_SOCKET, SO_ACCEPTCONN, &listening, &optlen) != 0 || !listening)
+            continue;
+        listen(fd, 1024);
+    }
 }
 
 void Usage() {
     fprintf(stderr,
             "usage: camsim [--port N] [--user U] [--password P] [--preset TOKEN=NAME]... "
-            "[--snapshot-stream] [--exit-on-stdin-eof]\n");
+            "[--snapshot-stream] [--threads N] [--exit-on-stdin-eof]\n");
     exit(2);
 }
 
 }  // namespace
 }  // namespace camsim
+
+// In a ThreadSanitizer build the simulator would sleep a second at exit (the
+// sanitizer's default, to catch races at exit), and every test that stops one
+// would wait for it.
+extern "C" const char* __tsan_default_options() { return "atexit_sleep_ms=0"; }
 
 int main(int argc, char** argv) {
     camsim::State state;
@@ -384,6 +417,8 @@ int main(int argc, char** argv) {
             presetsGiven = true;
         } else if (a == "--snapshot-stream") {
             state.faults["snapshot_stream"] = "1";
+        } else if (a == "--threads") {
+            camsim::gThreads = std::max(1, std::min(atoi(next().c_str()), 4096));
         } else if (a == "--exit-on-stdin-eof") {
             exitOnEof = true;
         } else {
@@ -432,6 +467,7 @@ int main(int argc, char** argv) {
         std::lock_guard<std::mutex> lock(state.mu);
         state.port = port;
     }
+    camsim::RaiseBacklog(port);
     printf("CAMSIM_PORT=%d\n", port);
     fflush(stdout);
     svr.listen_after_bind();

@@ -44,7 +44,12 @@ struct SoapReply {
     bool challenge = false;  // answer 401 with a digest challenge instead
 };
 
-// Which service an endpoint path serves ("device", "media", "ptz"), or "".
+// "http://host:port" that the camera advertises in its addresses (the
+// internal_address fault, else where it listens).
+std::string BaseAddress(State& state);
+
+// Which service an endpoint path serves ("device", "media", "ptz", "events",
+// "events:<path>" for an event subscription), or "".
 std::string ServiceOfPath(State& state, const std::string& path);
 
 // Handles one SOAP request to `service`. `httpAuthorized`: the request carried

@@ -8,6 +8,7 @@
 #include <sstream>
 
 #include "camsim.h"
+#include "camsim_events.h"
 
 namespace camsim {
 namespace {
@@ -101,14 +102,6 @@ SoapReply Fault(State& state, int status, const char* code, const char* subcode,
     std::string forced = state.Fault("fault_http_status");
     r.status = forced.empty() ? status : atoi(forced.c_str());
     return r;
-}
-
-// "http://host:port" that the camera advertises in its addresses.
-std::string BaseAddress(State& state) {
-    std::string internal = state.Fault("internal_address");
-    if (!internal.empty()) return "http://" + internal;
-    std::lock_guard<std::mutex> lock(state.mu);
-    return "http://127.0.0.1:" + std::to_string(state.port);
 }
 
 std::string MediaPath(State& state) {
@@ -208,6 +201,12 @@ SoapReply GetCapabilities(State& state) {
         "</tt:AccessPolicyConfig><tt:X.509Token>false</tt:X.509Token><tt:SAMLToken>false"
         "</tt:SAMLToken><tt:KerberosToken>false</tt:KerberosToken><tt:RELToken>false"
         "</tt:RELToken></tt:Security></tt:Device>"
+        "<tt:Events><tt:XAddr>" +
+        base + kEventServicePath +
+        "</tt:XAddr><tt:WSSubscriptionPolicySupport>false</tt:WSSubscriptionPolicySupport>"
+        "<tt:WSPullPointSupport>true</tt:WSPullPointSupport>"
+        "<tt:WSPausableSubscriptionManagerInterfaceSupport>false"
+        "</tt:WSPausableSubscriptionManagerInterfaceSupport></tt:Events>"
         "<tt:Media><tt:XAddr>" +
         base + MediaPath(state) +
         "</tt:XAddr>"
@@ -236,6 +235,7 @@ SoapReply GetServices(State& state) {
                    40) +
         ServiceXml("http://www.onvif.org/ver10/media/wsdl", base + MediaPath(state), 2, 40) +
         ServiceXml("http://www.onvif.org/ver20/ptz/wsdl", base + PtzPath(state), 2, 40) +
+        ServiceXml("http://www.onvif.org/ver10/events/wsdl", base + kEventServicePath, 2, 40) +
         "</tds:GetServicesResponse>");
 }
 
@@ -494,11 +494,18 @@ SoapReply GetStatus(State& state, pugi::xml_node request) {
 
 }  // namespace
 
+std::string BaseAddress(State& state) {
+    std::string internal = state.Fault("internal_address");
+    if (!internal.empty()) return "http://" + internal;
+    std::lock_guard<std::mutex> lock(state.mu);
+    return "http://127.0.0.1:" + std::to_string(state.port);
+}
+
 std::string ServiceOfPath(State& state, const std::string& path) {
     if (path == "/onvif/device_service") return "device";
     if (path == MediaPath(state)) return "media";
     if (path == PtzPath(state)) return "ptz";
-    return "";
+    return EventServiceOfPath(path);
 }
 
 SoapReply HandleSoap(State& state, const std::string& service, const std::string& body,
@@ -548,6 +555,7 @@ SoapReply HandleSoap(State& state, const std::string& service, const std::string
         }
     }
 
+    if (service.rfind("events", 0) == 0) return HandleEvents(state, service, envelope, request);
     if (service == "device") {
         if (action == "GetSystemDateAndTime") return GetSystemDateAndTime(state);
         if (action == "GetCapabilities") return GetCapabilities(state);
