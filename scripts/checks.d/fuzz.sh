@@ -2,7 +2,8 @@
 # Fuzzes the parsers that read what cameras and servers send, with libFuzzer
 # (clang, ASan + UBSan, leaks detected), each for a bounded time: FUZZ_SECONDS
 # per target (default 60). Targets: the multipart parser, the ONVIF reply
-# reader, the HTTP response head reader. Each starts from a copy of its seed
+# reader, the ONVIF event reply reader and event trackers, the HTTP response
+# head reader. Each starts from a copy of its seed
 # corpus (tests/fuzz/corpus/<target>) with its dictionary (tests/fuzz/
 # <target>.dict), guided by the values compared as well as by coverage (the
 # XML library is not instrumented). A crash, a leak or an allocation above
@@ -31,12 +32,13 @@ targets=(
   "multipart_parser 4096 hostlib/http/multipart_parser.cpp"
   "onvif_reply 16384 hostlib/camera/onvif_soap.cpp -lpugixml -lcrypto"
   "response_head 4096 hostlib/http/response_head.cpp"
+  "onvif_events 8192 hostlib/camera/onvif_soap.cpp hostlib/camera/onvif_event_soap.cpp hostlib/camera/onvif_event_tracker.cpp -lpugixml -lcrypto"
 )
 for t in "${targets[@]}"; do
   read -r name maxlen deps <<<"$t"
   # shellcheck disable=SC2086  # deps: several words
   clang++ -std=c++17 -g -O1 -fsanitize=fuzzer,address,undefined -fno-sanitize-recover=all \
-    -I"$root" "tests/fuzz/${name}_fuzz.cpp" $deps -o "$out/${name}_fuzz"
+    -I"$root" -I"$build/generated" "tests/fuzz/${name}_fuzz.cpp" $deps -o "$out/${name}_fuzz"
   mkdir -p "$scratch/$name"
   cp "tests/fuzz/corpus/$name"/* "$scratch/$name"/
   echo "fuzz: $name for ${seconds}s"
