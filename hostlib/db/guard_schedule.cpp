@@ -5,6 +5,7 @@
 #include <stdlib.h>
 #include <strings.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdio>
 
@@ -102,6 +103,19 @@ GuardScheduleInForce GuardScheduleAt(const std::vector<GuardScheduleEntry>& entr
             break;
         }
     }
+    // The next start of each entry after now: the first day from today with one.
+    int64_t next = best.entry != nullptr ? static_cast<int64_t>(best.until) : at + 8 * kDay;
+    for (const GuardScheduleEntry& e : entries) {
+        if (!Usable(e)) continue;
+        for (int64_t day = today; day <= today + 7; ++day) {
+            if ((e.days & (1 << Weekday(day))) == 0) continue;
+            const int64_t since = FirstAt(day * kDay + e.startSecond);
+            if (since <= at) continue;
+            next = std::min(next, since);
+            break;
+        }
+    }
+    best.next = static_cast<time_t>(next);
     return best;
 }
 

@@ -51,6 +51,11 @@ struct GuardScheduleInForce {
     const GuardScheduleEntry* entry = nullptr;  // into the entries given; null: none in force
     time_t since = 0;                           // when its present occurrence began
     time_t until = 0;                           // when that occurrence ends
+    // The next moment the answer may change: the end of that occurrence or
+    // the next start of any entry, whichever is first; at most 8 days ahead.
+    // Until then (and while the entries, the zone and the clock's course
+    // stay) the answer is the same.
+    time_t next = 0;
 };
 
 // The entry of `entries` in force at `now` in the process's time zone. A pure

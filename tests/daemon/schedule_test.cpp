@@ -131,8 +131,20 @@ TEST_F(ScheduleTest, EntryInForceAcrossDaylightSavingAndMidnight) {
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(std::string(c.what) + " at " + c.at);
-        const GuardScheduleInForce r = GuardScheduleAt(c.entries, At(c.at));
+        const time_t at = At(c.at);
+        const GuardScheduleInForce r = GuardScheduleAt(c.entries, at);
         ASSERT_EQ(r.entry ? r.entry->id : 0, c.id);
+        // The same answer up to `next` (every entry here changes on a
+        // quarter hour), another one there.
+        const auto same = [&](const GuardScheduleInForce& o) {
+            return o.entry == r.entry && o.since == r.since;
+        };
+        ASSERT_GT(r.next, at);
+        for (time_t t = at; t < r.next; t += 900) ASSERT_TRUE(same(GuardScheduleAt(c.entries, t)));
+        EXPECT_TRUE(same(GuardScheduleAt(c.entries, r.next - 1)));
+        if (r.next < at + 8 * 86400) {
+            EXPECT_FALSE(same(GuardScheduleAt(c.entries, r.next)));
+        }
         if (c.id == 0) continue;
         EXPECT_EQ(r.since, At(c.since));
         EXPECT_EQ(r.until, At(c.until));
