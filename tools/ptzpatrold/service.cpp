@@ -147,7 +147,9 @@ struct Service::Camera {
     std::unique_ptr<onvif::EventSource> events;  // null: no events (not ONVIF)
     int repeat = 1, pause = 1, eventValid = 10;  // the guard's Init values
 
-    bool judged = false;  // Tick has run once
+    bool judged = false;            // Tick has worked out the entry in force once
+    bool entriesChanged = false;    // since then
+    time_t judgedAt = 0, next = 0;  // when, and when it may change (GuardScheduleAt)
     bool inForce = false;
     GuardScheduleEntry entry;  // in force, when inForce
     time_t since = 0, until = 0;
@@ -234,19 +236,25 @@ void Service::Step() {
     if (fresh) Apply(*fresh);
     const bool tick = now != lastTick_;
     lastTick_ = now;
+    // The sources are looked at only when the hub says something changed.
+    const uint64_t changes = hub_->Changes();
+    const bool eventsMoved = changes != eventChanges_;
+    const bool statusMoved = tick && changes != watchedChanges_;
+    eventChanges_ = changes;
+    if (statusMoved) watchedChanges_ = changes;
     for (auto& entry : cameras_) {
         Camera& c = *entry.second;
         if (tick) {
             Tick(c, now);
-            WatchEvents(c);
-        } else if (c.events) {
+            if (statusMoved) WatchEvents(c);
+            WatchGuard(c);
+        } else if (c.events && eventsMoved) {
             EVENT_STATUS f, s;
             c.events->Read(&f, &s);
             if (f.active != c.first.active || f.reserved != c.first.reserved ||
                 s.active != c.second.active || s.reserved != c.second.reserved)
                 Analyze(c);
         }
-        WatchGuard(c);
     }
 }
 
@@ -275,6 +283,7 @@ void Service::Apply(Schedule& schedule) {
         if (s.entries != c.entries) {
             Log(LOG_NOTICE, "camera %d: schedule changed (%zu entries)", id, s.entries.size());
             c.entries = s.entries;
+            c.entriesChanged = true;
         }
         if (s.problem != c.problem && !s.problem.empty()) {
             Log(LOG_WARNING, "camera %d: %s", id, s.problem.c_str());
@@ -329,33 +338,45 @@ void Service::MakeEvents(Camera& c) {
     o.port = c.record.port;
     o.username = c.record.username;
     o.password = c.record.password;
+    o.pullSeconds = options_.eventPullSeconds;
+    o.subscriptionSeconds = options_.eventSubscriptionSeconds;
     o.stopTimeoutMs = options_.eventStopMs;
     c.events = std::make_unique<onvif::EventSource>(*hub_, o);
 }
 
 void Service::Tick(Camera& c, time_t now) {
-    const GuardScheduleInForce r = GuardScheduleAt(c.entries, now);
-    const bool inForce = r.entry != nullptr;
-    if (!c.judged || inForce != c.inForce ||
-        (inForce && (*r.entry != c.entry || r.since != c.since))) {
-        if (inForce) {
-            Log(LOG_INFO, "camera %d: entry %d in force: patrol %d, mode %s, until %s", c.id,
-                r.entry->id, r.entry->patrolId, ScheduleModeText(r.entry->mode),
-                LocalIso(r.until).c_str());
-            c.entry = *r.entry;
-            c.since = r.since;
-            c.until = r.until;
-        } else if (c.judged) {
-            Log(LOG_INFO, "camera %d: no entry in force", c.id);
+    // The entry in force is worked out again only when it may have changed
+    // (and once a minute, for a new time zone or a clock set back).
+    if (!c.judged || c.entriesChanged || now >= c.next || now < c.judgedAt ||
+        now - c.judgedAt >= 60) {
+        const GuardScheduleInForce r = GuardScheduleAt(c.entries, now);
+        const bool inForce = r.entry != nullptr;
+        if (!c.judged || inForce != c.inForce ||
+            (inForce && (*r.entry != c.entry || r.since != c.since))) {
+            if (inForce) {
+                Log(LOG_INFO, "camera %d: entry %d in force: patrol %d, mode %s, until %s", c.id,
+                    r.entry->id, r.entry->patrolId, ScheduleModeText(r.entry->mode),
+                    LocalIso(r.until).c_str());
+                c.entry = *r.entry;
+                c.since = r.since;
+                c.until = r.until;
+            } else if (c.judged) {
+                Log(LOG_INFO, "camera %d: no entry in force", c.id);
+            }
+            c.inForce = inForce;
+            c.judged = true;
         }
-        c.inForce = inForce;
-        c.judged = true;
+        c.entriesChanged = false;
+        c.judgedAt = now;
+        c.next = r.next;
     }
-    if (inForce && (r.entry->repeatCount != c.repeat || r.entry->pauseMinutes != c.pause ||
-                    r.entry->eventValidSeconds != c.eventValid))
-        ReplaceGuard(c, *r.entry);
-    const GuardScheduleInfo info = inForce ? GuardScheduleInfo{r.entry->patrolId, r.entry->mode}
-                                           : GuardScheduleInfo{0, GUARD_MODE_OFF};
+    const bool inForce = c.inForce;
+    const GuardScheduleEntry* const e = inForce ? &c.entry : nullptr;
+    if (inForce && (e->repeatCount != c.repeat || e->pauseMinutes != c.pause ||
+                    e->eventValidSeconds != c.eventValid))
+        ReplaceGuard(c, *e);
+    const GuardScheduleInfo info =
+        inForce ? GuardScheduleInfo{e->patrolId, e->mode} : GuardScheduleInfo{0, GUARD_MODE_OFF};
     if (info.patrolId != c.info.patrolId || info.mode != c.info.mode) c.stopAskedUs = WallMicros();
     c.info = info;
     Analyze(c);
@@ -391,9 +412,9 @@ void Service::WatchGuard(Camera& c) {
     const bool fresh = run.runs != c.run.runs;
     if (fresh) c.runSeenUs = now;
     // Ended since the last look: the run seen running, or one begun and ended
-    // between two looks (it began at most a step before it was seen).
+    // between two looks (it began at most a tick before it was seen).
     if ((c.run.running || fresh) && !run.running && run.runs > 0 && run.type == PATROL_EXEC_GUARD &&
-        run.runMoves < run.presetCount + 1 && c.stopAskedUs < c.runSeenUs - 1000000) {
+        run.runMoves < run.presetCount + 1 && c.stopAskedUs < c.runSeenUs - 2000000) {
         c.Fail("guard run of patrol " + std::to_string(run.patrolId) + " ended after " +
                std::to_string(run.runMoves) + " of " + std::to_string(run.presetCount + 1) +
                " moves: a move failed");

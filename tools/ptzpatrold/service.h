@@ -6,8 +6,9 @@
 // events: both read absent). Once a second the entry in force
 // (GuardScheduleAt) and the two event statuses go to AnalyzeSchedule (no
 // entry in force: mode OFF, which stops a running guard); between those
-// ticks a change of an event (its state or its alarm count, looked at every
-// 100 ms) is passed on at once.
+// ticks a change of an event (its state or its alarm count) is passed on
+// within 100 ms: the sources are read again when the hub counts a change.
+// The entry in force is worked out again only when it may have changed.
 //
 // The guard's repeat count, pause and event validity are fixed when it is
 // made. When the entry in force asks for other values the guard is
@@ -46,7 +47,14 @@
 namespace ptzd {
 
 struct Options {
-    int pollSeconds = 5;    // how often the tables are looked at
+    int pollSeconds = 5;  // how often the tables are looked at
+    // Event subscriptions: a long poll of 30 s and 120 s asked for each
+    // subscription (renewed at half) keep hundreds of idle cameras to a
+    // request every 20 s each (the event sources' defaults, 10 s and 60 s,
+    // make twice as many); an event still arrives at once. A camera that
+    // vanishes without closing its connection is noticed within 35 s.
+    int eventPullSeconds = 30;
+    int eventSubscriptionSeconds = 120;
     int eventStopMs = 300;  // bound of a camera's Unsubscribe when stopping
 };
 
@@ -108,6 +116,7 @@ private:
     std::map<int, std::unique_ptr<Camera>> cameras_;
     std::vector<std::string> problems_;
     time_t lastTick_ = 0;
+    uint64_t eventChanges_ = 0, watchedChanges_ = 0;  // hub_->Changes() as last looked at
     bool stopped_ = false;
 
     // Between the loader and Step. Guarded by loaderMu_.
