@@ -281,7 +281,7 @@ void Service::Apply(Schedule& schedule) {
         }
         Camera& c = *it->second;
         if (s.entries != c.entries) {
-            Log(LOG_NOTICE, "camera %d: schedule changed (%zu entries)", id, s.entries.size());
+            Log(LOG_NOTICE, "camera %d: schedule changed (entries: %zu)", id, s.entries.size());
             c.entries = s.entries;
             c.entriesChanged = true;
         }
@@ -321,7 +321,7 @@ void Service::StartCamera(int id, Schedule::Camera& s, time_t now) {
     c.executor = std::make_unique<PatrolExecutor>();
     c.guard = std::make_unique<GuardExecutor>(id);
     c.guard->Init(c.executor.get(), c.repeat, c.pause, c.eventValid);
-    Log(LOG_NOTICE, "camera %d: guarding (%zu schedule entries, events %s)", id, c.entries.size(),
+    Log(LOG_NOTICE, "camera %d: guarding (schedule entries: %zu; events %s)", id, c.entries.size(),
         IsOnvif(c.record) ? "over ONVIF" : "none: not an ONVIF camera");
     MakeEvents(c);
     cameras_[id] = std::move(owned);
