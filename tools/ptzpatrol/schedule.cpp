@@ -199,9 +199,11 @@ int Status(const std::string& daemon) {
              c.value("guard", "?"),
              run.value("running", false)
                  ? run.value("type", "") + " patrol " + std::to_string(run.value("patrol", 0)) +
-                       " preset " + std::to_string(run.value("index", 0) + 1) + "/" +
-                       std::to_string(run.value("count", 0)) + " position " +
-                       std::to_string(run.value("position", 0))
+                       (run.value("index", -1) < 0
+                            ? " starting"
+                            : " preset " + std::to_string(run.value("index", 0) + 1) + "/" +
+                                  std::to_string(run.value("count", 0)) + " position " +
+                                  std::to_string(run.value("position", 0)))
                  : "-",
              EventText(c["events"], "first"), EventText(c["events"], "second"),
              c["lastError"].is_string() ? c["lastError"].get<std::string>() : "-"});

@@ -157,6 +157,7 @@ struct Service::Camera {
     EVENT_STATUS first{}, second{};             // as last read
     int state = GUARD_STATE_IDLE;               // as last seen
     bool eventsUp = false;
+    std::string eventError;  // the event source's error as last logged
     std::string lastError;
     int64_t lastErrorUs = 0;  // wall time
 
@@ -442,6 +443,11 @@ void Service::WatchEvents(Camera& c) {
             Log(LOG_WARNING, "camera %d: events lost: %s", c.id,
                 st.lastError.empty() ? "no subscription" : st.lastError.c_str());
         }
+        c.eventError = st.lastError;
+    } else if (!st.subscribed && st.lastError != c.eventError) {
+        // Never connected, or failing anew: each new reason once.
+        Log(LOG_WARNING, "camera %d: events unavailable: %s", c.id, st.lastError.c_str());
+        c.eventError = st.lastError;
     }
     if (!st.lastError.empty() && st.lastErrorUs > c.lastErrorUs) {
         c.lastError = st.lastError;
