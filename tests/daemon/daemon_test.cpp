@@ -237,6 +237,45 @@ TEST_F(DaemonTest, GuardsFromScheduleAndEventsFollowsChangesStopsOnSigterm) {
     EXPECT_EQ(sim_.Events().live, 0);
 }
 
+// A database that stops answering (its statements wait out their timeout)
+// does not hold up the stop: the service leaves within a second all the same.
+TEST_F(DaemonTest, StopsWithinASecondWhileTheDatabaseStalls) {
+    const std::string cam = std::to_string(NewId({"camera", "add", "--host", "127.0.0.1", "--port",
+                                                  std::to_string(sim_.Port()), "--user", "admin"}));
+    const std::string patrol =
+        std::to_string(NewId({"patrol", "create", cam, "Tour", "--stay", "1", "1", "5"}));
+    NewId({"schedule", "add", cam, "--patrol", patrol, "--mode", "continuous", "--repeat", "0"});
+    Process daemon({PTZPATROLD_BINARY, "--listen", "127.0.0.1:0", "--poll", "1"});
+    const std::string address = daemon.ReadLine().substr(strlen("listening on "));
+    json c;
+    ASSERT_TRUE(WaitCamera(
+        address, [](const json& c) { return c["run"]["running"] == true; }, &c))
+        << c.dump();
+
+    ASSERT_EQ(pgtest::Cluster("stall"), 0);
+    struct Resume {
+        ~Resume() { pgtest::Cluster("resume"); }
+    } resume;
+    // Reading every second, the reader is waiting for the database once its
+    // last read is 2 s old (its guard's moves wait too: they read the camera record).
+    std::string readAt;
+    auto unchanged = Clock::now();
+    for (const auto deadline = Clock::now() + 10s; Clock::now() - unchanged < 2s;
+         std::this_thread::sleep_for(100ms)) {
+        ASSERT_LT(Clock::now(), deadline);
+        const json s = Status(address);
+        ASSERT_TRUE(s.is_object());
+        if (s["schedule"]["readAt"].dump() != readAt) {
+            readAt = s["schedule"]["readAt"].dump();
+            unchanged = Clock::now();
+        }
+    }
+    const auto sent = Clock::now();
+    daemon.Signal(SIGTERM);
+    EXPECT_EQ(daemon.Wait(), 0);
+    EXPECT_LT(Clock::now() - sent, 1s);
+}
+
 TEST(DaemonArgs, StatusServedOnLoopbackOnly) {
     for (const char* address :
          {"0.0.0.0:7478", "192.0.2.1:7478", "localhost:7478", "127.0.0.1:x"}) {

@@ -14,6 +14,7 @@
 #include <pthread.h>
 #include <signal.h>
 #include <syslog.h>
+#include <unistd.h>
 
 #include <CLI/CLI.hpp>
 #include <chrono>
@@ -119,5 +120,8 @@ int main(int argc, char** argv) {
     ptzd::Log(LOG_NOTICE, "stopped in %.0f ms",
               std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - stopping)
                   .count());
+    // Cameras, guards and executors are stopped; only a read of the tables
+    // may still wait for the database, and the process does not.
+    if (service.Abandoned()) _exit(0);
     return 0;
 }

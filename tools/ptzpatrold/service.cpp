@@ -23,6 +23,8 @@ using nlohmann::json;
 namespace {
 
 const char* const kStateNames[] = {"idle", "running", "interval", "holdoff"};
+// Stop gives the guards, executors, event sources and the loader this long.
+constexpr auto kStopBound = std::chrono::milliseconds(900);
 
 const char* StateName(int state) { return state >= 0 && state < 4 ? kStateNames[state] : "?"; }
 
@@ -137,6 +139,22 @@ int LoadSchedule(Schedule* schedule) {
     return 0;
 }
 
+// The cameras being stopped, shared with the threads that stop them (which
+// may outlive Stop when a call is still in flight).
+struct Service::Teardown {
+    std::vector<std::unique_ptr<Camera>> cameras;
+    std::atomic<size_t> next{0};
+    std::mutex mu;
+    std::condition_variable cv;
+    size_t pending = 1;  // threads not finished (the hub's, and the workers); under mu
+
+    void Finished() {
+        std::lock_guard<std::mutex> lock(mu);
+        --pending;
+        cv.notify_all();
+    }
+};
+
 struct Service::Camera {
     int id = 0;
     CameraSettings record;
@@ -179,7 +197,10 @@ Service::Service(const Options& options)
 
 Service::~Service() { Stop(); }
 
-void Service::Start() { loader_ = std::thread(&Service::LoaderMain, this); }
+void Service::Start() {
+    loaderDone_ = false;  // before any other thread runs
+    loader_ = std::thread(&Service::LoaderMain, this);
+}
 
 void Service::Reload() {
     std::lock_guard<std::mutex> lock(loaderMu_);
@@ -223,6 +244,8 @@ void Service::LoaderMain() {
         loaderWake_.wait_for(lock, std::chrono::seconds(options_.pollSeconds),
                              [this] { return quit_ || reload_; });
     }
+    loaderDone_ = true;
+    loaderWake_.notify_all();
 }
 
 void Service::Step() {
@@ -536,42 +559,64 @@ json Service::Status() {
 }
 
 void Service::Stop() {
+    const auto deadline = std::chrono::steady_clock::now() + kStopBound;
     {
         std::lock_guard<std::mutex> lock(loaderMu_);
+        if (quit_) return;
         quit_ = true;
         loaderWake_.notify_all();
     }
-    if (loader_.joinable()) loader_.join();
-
-    std::vector<std::unique_ptr<Camera>> cameras;
+    auto teardown = std::make_shared<Teardown>();
     {
         std::lock_guard<std::mutex> lock(mu_);
-        if (stopped_) return;
         stopped_ = true;
-        for (auto& c : cameras_) cameras.push_back(std::move(c.second));
+        for (auto& c : cameras_) teardown->cameras.push_back(std::move(c.second));
         cameras_.clear();
     }
     // The hub stops every subscription at once (their Unsubscribes bounded
     // together), while the guards and executors stop beside it: a few
-    // threads each take the next camera, so an executor waiting for a move
+    // threads each take the next camera, so an executor waiting for a call
     // in flight holds up only its own thread.
-    std::thread hubStop([this] { hub_.reset(); });
-    std::atomic<size_t> next{0};
-    const auto work = [&cameras, &next] {
-        for (size_t i; (i = next++) < cameras.size();) {
-            Camera& c = *cameras[i];
-            c.guard->Terminate();
-            c.executor->RemovePatrol(PATROL_EXEC_GUARD);
-            c.executor.reset();
-        }
-    };
-    std::vector<std::thread> workers;
-    const size_t threads = std::min<size_t>(8, (cameras.size() + 31) / 32);
-    for (size_t i = 1; i < threads; ++i) workers.emplace_back(work);
-    work();
-    for (std::thread& t : workers) t.join();
-    hubStop.join();
-    cameras.clear();  // the sources' Stop returns at once: the hub is gone
+    std::vector<std::thread> threads;
+    threads.emplace_back([teardown, hub = std::move(hub_)]() mutable {
+        hub.reset();
+        teardown->Finished();
+    });
+    const size_t workers = std::max<size_t>(1, std::min<size_t>(8, teardown->cameras.size() / 32));
+    teardown->pending += workers;
+    for (size_t i = 0; i < workers; ++i) {
+        threads.emplace_back([teardown] {
+            for (size_t i; (i = teardown->next++) < teardown->cameras.size();) {
+                Camera& c = *teardown->cameras[i];
+                c.guard->Terminate();
+                c.executor->RemovePatrol(PATROL_EXEC_GUARD);
+                c.executor.reset();
+            }
+            teardown->Finished();
+        });
+    }
+    bool done;
+    {
+        std::unique_lock<std::mutex> lock(teardown->mu);
+        done = teardown->cv.wait_until(lock, deadline, [&] { return teardown->pending == 0; });
+    }
+    {
+        std::unique_lock<std::mutex> lock(loaderMu_);
+        done = loaderWake_.wait_until(lock, deadline, [this] { return loaderDone_; }) && done;
+    }
+    if (!done) {
+        // A camera or database call is still in flight: the owner ends the
+        // process without waiting for it (nothing is left half-written: a
+        // statement cut off commits nothing).
+        for (std::thread& t : threads) t.detach();
+        if (loader_.joinable()) loader_.detach();
+        abandoned_ = true;
+        Log(LOG_WARNING, "a camera or database call still in flight is not waited for");
+        return;
+    }
+    for (std::thread& t : threads) t.join();
+    if (loader_.joinable()) loader_.join();
+    teardown->cameras.clear();  // the sources' Stop returns at once: the hub is gone
 }
 
 }  // namespace ptzd

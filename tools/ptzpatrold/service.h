@@ -91,11 +91,16 @@ public:
     // The state of every camera, as the status request answers it.
     nlohmann::json Status();
     // Stops the loader, every guard, executor and event source, in parallel
-    // where a call may wait; returns when all are gone. Idempotent.
+    // where a call may wait; returns when all are gone, or after 900 ms with
+    // a camera or database call still in flight, which is left to run
+    // (Abandoned): the owner then ends the process without destroying the
+    // service. Idempotent.
     void Stop();
+    bool Abandoned() const { return abandoned_; }
 
 private:
     struct Camera;
+    struct Teardown;
 
     void LoaderMain();
     void Apply(Schedule& schedule);
@@ -124,9 +129,11 @@ private:
     std::condition_variable loaderWake_;
     std::unique_ptr<Schedule> fresh_;  // read, not yet applied
     bool reload_ = false, quit_ = false;
-    std::string readError_;  // "" while the tables are read
-    time_t readAt_ = 0;      // last successful look at the tables
+    bool loaderDone_ = true;  // no loader running (Start clears it)
+    std::string readError_;   // "" while the tables are read
+    time_t readAt_ = 0;       // last successful look at the tables
     std::thread loader_;
+    bool abandoned_ = false;  // Stop left the loader running (owner thread only)
 };
 
 // Local time as ISO 8601 with the zone's offset ("2024-10-27T02:30:00+02:00").
