@@ -89,7 +89,9 @@ set(CPACK_COMPONENT_DEV_DESCRIPTION
 set(CPACK_DEBIAN_TOOLS_PACKAGE_NAME ptzpatrol)
 set(CPACK_DEBIAN_TOOLS_PACKAGE_SECTION video)
 set(CPACK_COMPONENT_TOOLS_DESCRIPTION
-    "PTZ camera patrols and snapshots: command-line tool and database schema
- The ptzpatrol tool manages cameras and patrols, runs patrols and guards and
- takes snapshots; schema.sql creates the tables.")
+    "PTZ camera patrols and snapshots: command-line tool, guard service, schema
+ The ptzpatrol tool manages cameras, patrols and weekly guard schedules, runs
+ patrols and guards and takes snapshots; the ptzpatrold service (with its
+ systemd unit) guards every scheduled camera from the entry in force and the
+ camera's events; schema.sql creates the tables.")
 include(CPack)

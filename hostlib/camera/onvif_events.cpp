@@ -12,6 +12,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <map>
@@ -74,6 +75,8 @@ struct EventHub::Impl {
     std::set<uint64_t> stopped;  // Stop requests done, until their caller takes them
     bool quit = false;
     bool running = false;  // the thread takes requests
+    // What the sources read changed (EventHub::Changes); written by the hub thread.
+    std::atomic<uint64_t> changes{0};
     uint64_t nextId = 1;
 
     // Set up by the constructor; used by the hub thread only (Wake by any).
@@ -103,8 +106,9 @@ namespace {
 // One camera's dialogue; lives on the hub thread only.
 class Session {
 public:
-    Session(CURLM* multi, const EventSourceOptions& o, std::shared_ptr<Shared> shared)
-        : multi_(multi), o_(o), shared_(std::move(shared)) {
+    Session(CURLM* multi, const EventSourceOptions& o, std::shared_ptr<Shared> shared,
+            std::atomic<uint64_t>* changes)
+        : multi_(multi), o_(o), shared_(std::move(shared)), changes_(changes) {
         o_.subscriptionSeconds = std::max(o_.subscriptionSeconds, 2);
         o_.pullSeconds = std::max(o_.pullSeconds, 1);
         o_.retryMinMs = std::max(o_.retryMinMs, 1);
@@ -149,6 +153,7 @@ public:
             shared_->second.Clear();
             shared_->status.subscribed = false;
         }
+        ++*changes_;
         if (sub_.live) {
             sub_.live = false;
             OnSubscription(Step::kFinalUnsubscribe, EventCall::kUnsubscribe, sub_, 0,
@@ -317,6 +322,7 @@ private:
                     shared_->status.subscribed = true;
                     ++shared_->status.subscriptions;
                 }
+                ++*changes_;
                 return OnSubscription(Step::kSync, EventCall::kSetSynchronizationPoint, sub_, 0,
                                       o_.callTimeoutMs);
             }
@@ -389,6 +395,7 @@ private:
                 shared_->second.Apply(n, arrivedUs_, offsetUs_);
             }
         }
+        if (!messages.empty()) ++*changes_;
         failures_ = 0;
         // A camera that answers at once without messages is not pulled in a loop.
         if (messages.empty() && dropped == 0 &&
@@ -410,6 +417,7 @@ private:
             shared_->second.Lose(WallMicros());
             shared_->status.subscribed = false;
         }
+        ++*changes_;
         ++failures_;
         if (failures_ <= 1) return Subscribe();
         After(Backoff(), Next::kSubscribe);
@@ -436,6 +444,7 @@ private:
             }
             shared_->status.subscribed = false;
         }
+        ++*changes_;
         ++failures_;
         After(Backoff(), Next::kBegin);
     }
@@ -577,6 +586,7 @@ private:
     CURLM* multi_;
     EventSourceOptions o_;
     std::shared_ptr<Shared> shared_;
+    std::atomic<uint64_t>* changes_;  // the hub's
 
     CURL* curl_ = nullptr;  // kept with its connection between requests
     curl_slist* headers_ = nullptr;
@@ -664,7 +674,8 @@ void EventHub::Impl::Loop() {
             quitNow = quit;
         }
         for (Add& a : newSessions)
-            sessions[a.id] = std::make_unique<Session>(multi, a.options, std::move(a.shared));
+            sessions[a.id] =
+                std::make_unique<Session>(multi, a.options, std::move(a.shared), &changes);
         if (!newStops.empty()) {
             for (uint64_t id : newStops) {
                 auto it = sessions.find(id);
@@ -757,6 +768,8 @@ void EventHub::Close() {
     h.multi = nullptr;
     h.epoll = h.wake = -1;
 }
+
+uint64_t EventHub::Changes() const { return impl_->changes.load(); }
 
 EventHub::~EventHub() {
     if (!impl_->started) {

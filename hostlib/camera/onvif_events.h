@@ -171,6 +171,14 @@ public:
     EventHub(const EventHub&) = delete;
     EventHub& operator=(const EventHub&) = delete;
 
+    // Counts the changes of what the attached sources read: messages applied,
+    // subscriptions made, lost or stopped. While it stays the same no
+    // source's Read has changed its active flags or alarm counts, nor has its
+    // Status changed whether it is subscribed or its last error, so a reader
+    // of many sources can look at them only when it moved. Any thread; one
+    // atomic load.
+    uint64_t Changes() const;
+
     struct Impl;
 
 private:

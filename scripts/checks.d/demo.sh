@@ -28,4 +28,11 @@ for f in $images; do
   [ -f "$out/$f" ] || fail "the page names $f, which is missing"
   jpeg "$out/$f" || fail "$f is not a JPEG"
 done
+# The service scene: the guard's run seen while the entry was in force, then
+# the entry ended and the run with it; the service's log kept.
+jq -e '.cameras[0] | .guard == "running" and .run.running and .run.type == "guard" and .entry.mode == "first"' \
+  "$out/service/status-running.json" >/dev/null || fail "status-running.json shows no guard run"
+jq -e '.cameras[0] | .entry == null and (.run.running | not) and .guard != "running" and .run.moves > 0' \
+  "$out/service/status-ended.json" >/dev/null || fail "status-ended.json shows a run or an entry"
+[ -s "$out/service/ptzpatrold.log" ] || fail "no ptzpatrold.log"
 echo "demo: ok ($(echo "$images" | wc -l) snapshots)"

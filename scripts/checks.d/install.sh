@@ -62,6 +62,22 @@ has "usr/lib/$ma/cmake/ptzpatrol/ptzpatrolConfig.cmake"
 has "usr/include/ptzpatrol/patrol/patrol.h"
 has "usr/include/ptzpatrol/host/database.h"
 has "usr/share/ptzpatrol/schema.sql"
+# The service and its systemd unit come with the tool, in the ptzpatrol package.
+listing=$(dpkg-deb -c "$tools")
+for f in usr/bin/ptzpatrol usr/sbin/ptzpatrold usr/lib/systemd/system/ptzpatrold.service; do
+  grep -q " \./$f\$" <<<"$listing" || fail "no $f in the ptzpatrol package"
+done
+unit="$work/root/usr/lib/systemd/system/ptzpatrold.service"
+grep -q '^ExecStart=/usr/sbin/ptzpatrold ' "$unit" || fail "the unit does not start /usr/sbin/ptzpatrold"
+grep -q '^Restart=on-failure$' "$unit" || fail "the unit does not restart the service on failure"
+LD_LIBRARY_PATH="$work/root/usr/lib/$ma" "$work/root/usr/sbin/ptzpatrold" --help >/dev/null ||
+  fail "the packaged ptzpatrold does not run"
+if command -v systemd-analyze >/dev/null; then
+  # The unit's own syntax (the binary it names is checked above).
+  sed "s#/usr/sbin/ptzpatrold#$work/root/usr/sbin/ptzpatrold#" "$unit" >"$work/ptzpatrold.service"
+  verify=$(systemd-analyze verify "$work/ptzpatrold.service" 2>&1) || fail "systemd-analyze verify: $verify"
+  [ -z "$verify" ] || fail "systemd-analyze verify: $verify"
+fi
 dpkg-deb -c "$runtime" | grep -q '\.h$' && fail "headers in the runtime package"
 dpkg-deb -c "$runtime" | grep -q 'libptzpatrol.so$' && fail "the development link in the runtime package"
 depends() { dpkg-deb -f "$1" Depends; }

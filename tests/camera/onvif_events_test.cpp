@@ -89,9 +89,11 @@ TEST_F(OnvifEvents, MotionAndInputReachTheReaderWithinASecond) {
     ASSERT_TRUE(Subscribed(*source));
     EXPECT_EQ(Read(*source).first.active, 0);  // Initialized false is not a fall
     EXPECT_EQ(Read(*source).second.active, 0);
+    const uint64_t changes = hub.Changes();
 
     sim.SetEvents("motion=1");
     EXPECT_TRUE(WaitFor([&] { return IsOn(Read(*source).first); }, milliseconds(1000)));
+    EXPECT_TRUE(WaitFor([&] { return hub.Changes() > changes; }, milliseconds(100)));
     EXPECT_EQ(Read(*source).second.active, 0);
     int64_t before = WallUs();
     sim.SetEvents("motion=0");

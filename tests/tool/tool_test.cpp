@@ -208,6 +208,23 @@ TEST_F(ToolTest, FailuresGiveTheirExitCodeAndOneLine) {
         {{"guard", "51", "--mode", "any"}, {}, 77, "password refused"},
         {{"patrol", "create", silent, "n", "--stay", "1", "1"}, {}, 68, "no answer"},
         {{"snapshot", cam, "-o", "/nonexistent/x.jpg"}, {}, 73, "/nonexistent/x.jpg"},
+        {{"schedule", "add", cam, "--patrol", "50", "--mode", "often"}, {}, 64, "--mode"},
+        {{"schedule", "add", cam, "--patrol", "50", "--mode", "any", "--to", "24:00"},
+         {},
+         64,
+         "--to"},
+        {{"schedule", "add", cam, "--patrol", "50", "--mode", "any", "--days", "mon,fun"},
+         {},
+         64,
+         "--days"},
+        {{"schedule", "add", "99", "--patrol", "50", "--mode", "any"}, {}, 65, "no camera 99"},
+        {{"schedule", "add", cam, "--patrol", "50", "--mode", "any"},
+         {},
+         65,
+         "of camera " + silent},
+        {{"schedule", "remove", "99"}, {}, 65, "no schedule entry 99"},
+        {{"status", "--daemon", "localhost"}, {}, 64, "--daemon"},
+        {{"status", "--daemon", "127.0.0.1:1"}, {}, 69, "ptzpatrold at 127.0.0.1:1"},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(::testing::PrintToString(c.args));

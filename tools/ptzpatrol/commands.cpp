@@ -56,7 +56,7 @@ json PresetsJson(const Patrol& patrol) {
 int InitDb() {
     RequireDatabase(false);
     Exec(kSchemaSql);
-    Out::Emit("tables ready (patrol, patrol_preset, camera)", {{"event", "init-db"}, {"ok", true}});
+    Out::Emit("tables ready (patrol, patrol_preset, camera, guard_schedule)", {{"event", "init-db"}, {"ok", true}});
     return kOk;
 }
 
@@ -131,11 +131,15 @@ int CameraRemove(int camId) {
             throw Error{kDbError, "deleting patrol " + std::to_string(info.id) + " failed"};
         ++patrols;
     }
+    const int entries = DeleteScheduleEntries("camId = " + itos(camId));
     Exec("DELETE FROM camera WHERE id = " + itos(camId) + ";");
     SnapshotFileDelete(camId);
     Out::Emit("camera " + std::to_string(camId) + " removed, with " + std::to_string(patrols) +
-                  " patrol(s)",
-              {{"event", "camera-removed"}, {"id", camId}, {"patrols", patrols}});
+                  " patrol(s) and " + std::to_string(entries) + " schedule entries",
+              {{"event", "camera-removed"},
+               {"id", camId},
+               {"patrols", patrols},
+               {"scheduleEntries", entries}});
     return kOk;
 }
 
@@ -267,8 +271,11 @@ int PatrolDelete(int id) {
     Patrol patrol = LoadStoredOnly(id);
     if (patrol.Delete() != 0)
         throw Error{kDbError, "deleting patrol " + std::to_string(id) + " failed"};
-    Out::Emit("patrol " + std::to_string(id) + " deleted",
-              {{"event", "patrol-deleted"}, {"id", id}});
+    // Its schedule entries would have nothing to run.
+    const int entries = DeleteScheduleEntries("patrolId = " + itos(id));
+    Out::Emit("patrol " + std::to_string(id) + " deleted" +
+                  (entries > 0 ? ", with " + std::to_string(entries) + " schedule entries" : ""),
+              {{"event", "patrol-deleted"}, {"id", id}, {"scheduleEntries", entries}});
     return kOk;
 }
 

@@ -45,6 +45,21 @@ struct GuardOptions {
 };
 int Guard(int patrolId, const GuardOptions& options);
 
+// Weekly guard schedules (schedule.cpp).
+struct ScheduleAddOptions {
+    int camId = 0, patrolId = 0;
+    std::string mode, days = "all", from = "00:00", to = "00:00";
+    int repeat = 1, pauseMinutes = 1, eventValidSeconds = 10;
+};
+int ScheduleAdd(const ScheduleAddOptions& options);
+int ScheduleList(int camId);
+int ScheduleRemove(int id);
+// Deletes the schedule entries that `where` (SQL) selects; how many. None
+// when the database predates schedules.
+int DeleteScheduleEntries(const std::string& where);
+// The status of ptzpatrold at HOST:PORT.
+int Status(const std::string& daemon);
+
 // One snapshot: into `file`, or the camera's /tmp file when `file` is empty.
 struct SnapshotTaken {
     std::string file;

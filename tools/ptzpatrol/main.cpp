@@ -16,8 +16,9 @@ namespace {
 
 const char* const kExitCodes =
     "Exit codes: 0 ok, 64 bad arguments, 65 unknown id (camera, patrol, preset), 66 password "
-    "file unreadable, 68 camera does not answer, 69 PostgreSQL unreachable, 73 output file not "
-    "written, 74 database statement failed, 76 camera refused the request, 77 camera refused the "
+    "file unreadable, 68 camera does not answer, 69 PostgreSQL (status: ptzpatrold) unreachable, 73 "
+    "output file not written, 74 database statement failed, 76 camera refused the request (status: "
+    "ptzpatrold gave no status), 77 camera refused the "
     "credentials, 78 no ptzpatrol tables (run init-db), 130 stopped by Ctrl-C.";
 
 }  // namespace
@@ -127,6 +128,44 @@ int main(int argc, char** argv) {
     guard->add_option("--snapshots", guardOptions.snapshotDir,
                       "Take a snapshot after each move, into DIR");
     on(guard, [&] { return Guard(patrolId, guardOptions); });
+
+    ScheduleAddOptions entry;
+    CLI::App* schedule = app.add_subcommand(
+        "schedule", "Weekly guard schedules that ptzpatrold follows: add, list, remove");
+    schedule->require_subcommand(1);
+    CLI::App* scheduleAdd = schedule->add_subcommand(
+        "add",
+        "Add an entry: on DAYS from FROM to TO (server time zone; TO exclusive, at or before FROM: "
+        "the next day; equal: a whole day) guard PATROL in MODE. Of overlapping entries the one "
+        "started last is in force");
+    scheduleAdd->add_option("CAMID", entry.camId, "Camera id")->required();
+    scheduleAdd->add_option("--patrol", entry.patrolId, "Patrol id (of this camera)")->required();
+    scheduleAdd->add_option("--mode", entry.mode, "continuous, first, second, any (or off)")
+        ->required();
+    scheduleAdd->add_option("--days", entry.days, "mon,tue,... or mon-fri, or all (default)");
+    scheduleAdd->add_option("--from", entry.from, "Start, HH:MM[:SS] (default 00:00)");
+    scheduleAdd->add_option("--to", entry.to, "End, HH:MM[:SS] (default 00:00)");
+    scheduleAdd->add_option("--repeat", entry.repeat, "Runs per start (0: without end; default 1)");
+    scheduleAdd->add_option("--pause", entry.pauseMinutes,
+                            "Pause after the runs in continuous mode, minutes (default 1)");
+    scheduleAdd->add_option("--event-valid", entry.eventValidSeconds,
+                            "How long an event counts, seconds (default 10)");
+    on(scheduleAdd, [&entry] { return ScheduleAdd(entry); });
+    CLI::App* scheduleList =
+        schedule->add_subcommand("list", "A camera's entries; the one in force now is marked");
+    scheduleList->add_option("CAMID", camId, "Camera id")->required();
+    on(scheduleList, [&camId] { return ScheduleList(camId); });
+    int entryId = 0;
+    CLI::App* scheduleRemove = schedule->add_subcommand("remove", "Remove an entry");
+    scheduleRemove->add_option("ID", entryId, "Entry id")->required();
+    on(scheduleRemove, [&entryId] { return ScheduleRemove(entryId); });
+
+    std::string daemon = "127.0.0.1:7478";
+    CLI::App* status = app.add_subcommand(
+        "status", "What ptzpatrold is doing: per camera the entry in force, the guard, the run, "
+                  "the events and the last error");
+    status->add_option("--daemon", daemon, "Where ptzpatrold listens (default 127.0.0.1:7478)");
+    on(status, [&daemon] { return Status(daemon); });
 
     std::string output;
     CLI::App* snapshot = app.add_subcommand(

@@ -23,9 +23,11 @@ enum Exit {
     kNoInput = 66,        // the password file cannot be read
     kCameraAbsent = 68,   // the camera does not answer (refused, timeout, no route)
     kDbUnavailable = 69,  // PostgreSQL cannot be reached
+    kUnavailable = 69,    // status: ptzpatrold cannot be reached (a service, as PostgreSQL)
     kCantCreate = 73,     // the output file cannot be written
     kDbError = 74,        // a database statement failed
     kCameraRefused = 76,  // the camera answered but refused the request, or its image
+    kProtocol = 76,       // status: ptzpatrold answered something else than its status
     kCameraAuth = 77,     // the camera refused the user name or password
     kNoTables = 78,       // the database has no ptzpatrol tables (run init-db)
     kInterrupted = 130,   // Ctrl-C
