@@ -388,19 +388,7 @@ private:
         curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers);
         curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, Collect);
         curl_easy_setopt(curl, CURLOPT_WRITEDATA, &text);
-        curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
-        curl_easy_setopt(curl, CURLOPT_TIMEOUT_MS, left);
-        curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT_MS, std::min(left, kConnectTimeoutMs));
-        curl_easy_setopt(curl, CURLOPT_NOPROXY, "*");
-        if (!user_.empty()) {
-            curl_easy_setopt(curl, CURLOPT_HTTPAUTH, CURLAUTH_DIGEST | CURLAUTH_BASIC);
-            curl_easy_setopt(curl, CURLOPT_USERNAME, user_.c_str());
-            curl_easy_setopt(curl, CURLOPT_PASSWORD, password_.c_str());
-        } else {
-            curl_easy_setopt(curl, CURLOPT_HTTPAUTH, CURLAUTH_NONE);
-            curl_easy_setopt(curl, CURLOPT_USERNAME, static_cast<char*>(nullptr));
-            curl_easy_setopt(curl, CURLOPT_PASSWORD, static_cast<char*>(nullptr));
-        }
+        SetBoundsAndCredentials(curl, left);
         CURLcode rc = curl_easy_perform(curl);
         long status = 0;
         curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
@@ -462,6 +450,25 @@ private:
         return Outcome::kAbsent;
     }
 
+    // The options every request of a call sets: its time bound (`left` ms),
+    // no signals, no proxy, and the camera's credentials for HTTP Digest or
+    // Basic (none without a user name; a kept handle forgets earlier ones).
+    void SetBoundsAndCredentials(CURL* curl, long left) const {
+        curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
+        curl_easy_setopt(curl, CURLOPT_TIMEOUT_MS, left);
+        curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT_MS, std::min(left, kConnectTimeoutMs));
+        curl_easy_setopt(curl, CURLOPT_NOPROXY, "*");
+        if (!user_.empty()) {
+            curl_easy_setopt(curl, CURLOPT_HTTPAUTH, CURLAUTH_DIGEST | CURLAUTH_BASIC);
+            curl_easy_setopt(curl, CURLOPT_USERNAME, user_.c_str());
+            curl_easy_setopt(curl, CURLOPT_PASSWORD, password_.c_str());
+        } else {
+            curl_easy_setopt(curl, CURLOPT_HTTPAUTH, CURLAUTH_NONE);
+            curl_easy_setopt(curl, CURLOPT_USERNAME, static_cast<char*>(nullptr));
+            curl_easy_setopt(curl, CURLOPT_PASSWORD, static_cast<char*>(nullptr));
+        }
+    }
+
     // What the snapshot URI serves, from the Content-Type of its response: 2
     // for a multipart stream (some cameras give their MJPEG stream as the
     // snapshot URI), 1 for anything else; -1 when no response came. One GET
@@ -481,15 +488,7 @@ private:
         curl_easy_setopt(curl, CURLOPT_HEADERFUNCTION, ProbeHeader);
         curl_easy_setopt(curl, CURLOPT_HEADERDATA, &contentType);
         curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, ProbeBody);
-        curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
-        curl_easy_setopt(curl, CURLOPT_TIMEOUT_MS, left);
-        curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT_MS, std::min(left, kConnectTimeoutMs));
-        curl_easy_setopt(curl, CURLOPT_NOPROXY, "*");
-        if (!user_.empty()) {
-            curl_easy_setopt(curl, CURLOPT_HTTPAUTH, CURLAUTH_DIGEST | CURLAUTH_BASIC);
-            curl_easy_setopt(curl, CURLOPT_USERNAME, user_.c_str());
-            curl_easy_setopt(curl, CURLOPT_PASSWORD, password_.c_str());
-        }
+        SetBoundsAndCredentials(curl, left);
         const CURLcode rc = curl_easy_perform(curl);
         long status = 0;
         curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);

@@ -287,6 +287,23 @@ int HostDBCheck(std::string* where, std::string* error) {
     if (error) *error = line;
     return -1;
 }
+bool HostDBQuery(const std::string& sql, const std::vector<const char*>& columns,
+                 std::vector<std::vector<std::string>>* rows) {
+    DBResult_tag* result = nullptr;
+    if (OvDBExecute(sql, &result) != 0) return false;
+    unsigned int row = 0;
+    while (KELODBFetchRow(result, &row) == 0) {
+        std::vector<std::string> values;
+        for (const char* column : columns) {
+            const char* v = KELODBFetchField(result, row, column);
+            values.push_back(v ? v : "");
+        }
+        rows->push_back(std::move(values));
+    }
+    KELODBFreeResult(result);
+    return true;
+}
+
 void HostDBSetPoolSize(int size) { ThePool().SetSize(size); }
 void HostDBSetStatementTimeoutMs(int ms) { statementTimeoutMs = ms > 0 ? ms : 1; }
 void HostDBCloseIdle() { ThePool().CloseIdle(); }

@@ -26,6 +26,7 @@
 #define HOSTLIB_DATABASE_CONFIG_H
 
 #include <string>
+#include <vector>
 
 // Sets the libpq conninfo string ("host=/run/pg dbname=nvr" or a URI) for
 // connections opened from now on, and closes the idle ones. Empty: environment only.
@@ -47,5 +48,11 @@ void HostDBCloseIdle();
 // followed by ", database D, user U"; `error` holds libpq's message on one
 // line. Either pointer may be null.
 int HostDBCheck(std::string* where, std::string* error);
+
+// For the host's own queries (our tools): runs `sql` and appends each row's
+// values of `columns` as text ("" for SQL NULL) to *rows. False when the
+// statement failed.
+bool HostDBQuery(const std::string& sql, const std::vector<const char*>& columns,
+                 std::vector<std::vector<std::string>>* rows);
 
 #endif  // HOSTLIB_DATABASE_CONFIG_H

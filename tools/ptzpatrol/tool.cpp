@@ -92,19 +92,8 @@ void RequireDatabase(bool tables) {
 
 std::vector<std::vector<std::string>> Query(const std::string& sql,
                                             const std::vector<const char*>& columns) {
-    DBResult_tag* result = nullptr;
-    if (OvDBExecute(sql, &result) != 0) throw Error{kDbError, "database statement failed: " + sql};
     std::vector<std::vector<std::string>> rows;
-    unsigned int row = 0;
-    while (KELODBFetchRow(result, &row) == 0) {
-        std::vector<std::string> values;
-        for (const char* column : columns) {
-            const char* v = KELODBFetchField(result, row, column);
-            values.push_back(v ? v : "");
-        }
-        rows.push_back(values);
-    }
-    KELODBFreeResult(result);
+    if (!HostDBQuery(sql, columns, &rows)) throw Error{kDbError, "database statement failed: " + sql};
     return rows;
 }
 

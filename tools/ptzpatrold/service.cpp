@@ -46,24 +46,6 @@ json IsoOrNull(int64_t micros) {
     return micros > 0 ? json(LocalIso(static_cast<time_t>(micros / 1000000))) : json(nullptr);
 }
 
-// Rows of one statement as text; false when it failed.
-bool Rows(const std::string& sql, const std::vector<const char*>& columns,
-          std::vector<std::vector<std::string>>* rows) {
-    DBResult_tag* result = nullptr;
-    if (OvDBExecute(sql, &result) != 0) return false;
-    unsigned int row = 0;
-    while (KELODBFetchRow(result, &row) == 0) {
-        std::vector<std::string> values;
-        for (const char* column : columns) {
-            const char* v = KELODBFetchField(result, row, column);
-            values.push_back(v ? v : "");
-        }
-        rows->push_back(std::move(values));
-    }
-    KELODBFreeResult(result);
-    return true;
-}
-
 }  // namespace
 
 void Log(int priority, const char* format, ...) {
@@ -87,11 +69,11 @@ int LoadSchedule(Schedule* schedule) {
     std::vector<GuardScheduleEntry> entries;
     std::vector<std::vector<std::string>> cameras, patrols;
     if (GuardScheduleLoad(0, &entries) != 0 ||
-        !Rows("SELECT id, host, port, username, password, vendor, model, channel FROM camera "
+        !HostDBQuery("SELECT id, host, port, username, password, vendor, model, channel FROM camera "
               "WHERE id IN (SELECT camId FROM guard_schedule);",
               {"id", "host", "port", "username", "password", "vendor", "model", "channel"},
               &cameras) ||
-        !Rows("SELECT id, camId FROM patrol WHERE id IN (SELECT patrolId FROM guard_schedule);",
+        !HostDBQuery("SELECT id, camId FROM patrol WHERE id IN (SELECT patrolId FROM guard_schedule);",
               {"id", "camId"}, &patrols))
         return -1;
     std::map<int, CameraSettings> records;
